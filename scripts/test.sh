@@ -1,0 +1,11 @@
+#!/usr/bin/env bash
+# Builds and runs the whole suite (unit and end-to-end tests) with CTest.
+set -euo pipefail
+cd "$(dirname "$0")/.."
+./scripts/setup.sh
+./scripts/build.sh
+dir="${KESU_BUILD_DIR:-build}"
+export ASAN_OPTIONS="${ASAN_OPTIONS:-detect_leaks=1:abort_on_error=1}"
+export UBSAN_OPTIONS="${UBSAN_OPTIONS:-print_stacktrace=1:halt_on_error=1}"
+export TSAN_OPTIONS="${TSAN_OPTIONS:-halt_on_error=1:second_deadlock_stack=1}"
+ctest --test-dir "$dir" --output-on-failure -j "$(nproc)" "$@"

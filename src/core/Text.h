@@ -1,0 +1,30 @@
+// Text helpers over UTF-8: validation, user-perceived characters (grapheme clusters) and the
+// "N#json" length prefix used on the control API and towards the PC suite.
+#pragma once
+
+#include <cstddef>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace kesu::text {
+
+bool isValidUtf8(std::string_view s);
+
+// The text cut into user-perceived characters (grapheme clusters). Invalid UTF-8 is cut
+// byte by byte so that nothing is lost.
+std::vector<std::string_view> graphemes(std::string_view s);
+std::size_t graphemeCount(std::string_view s);
+
+// "N#" + text, N the grapheme count; the empty text stays empty.
+std::string lengthPrefixed(std::string_view s);
+
+// Nesting depth of arrays and objects in a JSON text (brackets inside strings do not count).
+std::size_t jsonNestingDepth(std::string_view s);
+
+// Text with every ASCII blank and line end cut from both ends.
+std::string trim(std::string_view s);
+
+bool contains(std::string_view s, std::string_view part);
+
+}  // namespace kesu::text

@@ -1,0 +1,123 @@
+// Process-wide helpers: logging, time, text conversions, the shared flags and URLs, and thin
+// wrappers over the platform layer. Used only through static members.
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace kesu {
+
+enum class submoduleName { ConnectName };
+std::string rawValue(submoduleName name);  // "/KesuConnService_log/KesuConnService_"
+
+class Utils {
+public:
+    using Clock = std::chrono::system_clock;
+
+    static inline const std::string versionCode = "3.6.1.0";
+    static inline const std::string moduleName = "KesuConnService";
+    static constexpr int logTimeOut = 14;  // log files stay up to this many days
+
+    // ---- Logging and time --------------------------------------------------------------
+    // The service's only logging call: one line to standard output and to the day's file.
+    static void mPrintlog(const std::string& output);
+    // Flushes and closes the day's file (it is reopened by the next message).
+    static void closeLog();
+    static void deleteOldLogFile();
+    static void writeConnServiceVersion(const std::string& version);
+    static std::string getNowTime();          // local "yyyy-MM-dd HH:mm:ss.SSS"
+    static double currentTimeStamp();         // seconds since 1970, with fraction
+    static long long stringToTimestamp(const std::string& time);  // 0 when it does not parse
+    static Clock::time_point now();
+    // Replaces the clock (tests); an empty function puts the system clock back.
+    static void setClock(std::function<Clock::time_point()> clock);
+
+    static std::string logDirectory();                 // .../pcsuite/log/KesuConnService_log
+    static std::string logFilePath(Clock::time_point at);  // the file named by the GMT date
+    static std::string libraryBase();                  // home + "/Library/"
+
+    // ---- Processes and files -----------------------------------------------------------
+    static bool useCommandLine(const std::string& command);
+    static bool startProcess(const std::string& launchPath, const std::vector<std::string>& arguments,
+                             int& exitCode);
+    static bool isAppRunning(const std::string& appName);
+    static bool isFileExist(const std::string& filePath);
+    static void readFile(const std::string& filePath, std::string& fileContent);
+    // Starts a fresh copy of the service in place of this process. Returns only when that
+    // could not be done, in which case this process keeps running.
+    static void restartService();
+
+    // ---- Identity and counters ---------------------------------------------------------
+    static long long getNfcLanConnectSeqNo();
+    static std::string getLocalName();
+    static std::string getFullLocalName();
+    static std::string paramAddMask(const std::string& str);
+    static std::string getMacAddress();
+    static std::string getMacAddress2();
+    static std::string getBluetoothMacAddress();
+    static std::map<std::string, std::string> GetPcSystemInfo();
+
+    // ---- Network state -----------------------------------------------------------------
+    static std::map<std::string, std::string> getNetworkCorrespondAddress();
+    static std::vector<std::map<std::string, std::string>> GetNetworkInfoList();
+    static bool MacWifiNetworkAvailability();
+    static bool MacEthernetNetworkAvailability();
+    static std::string SsidWifiName();
+    static bool SsidWifiCondition();
+    static std::string GetWifiName();
+    static std::string GetEthernetName();
+    static bool isVpnOn();
+    static std::optional<bool> getFirewallState();
+    static bool isScreenUnlocked();
+    static bool pingAddress(const std::string& ip, int timeoutSeconds);
+
+    // ---- Actions -----------------------------------------------------------------------
+    static bool openWifi();
+    static std::string openWlanSetting();
+    static void getConnectCenterUrl();
+
+    // ---- Text conversions --------------------------------------------------------------
+    static std::string uintToHexString(const std::string& value);
+    static std::string asciiToString(const std::vector<std::uint8_t>& inBody);
+
+    // ---- Shared flags and URLs (thread-safe) -------------------------------------------
+    static bool getIsAllowWindow();
+    static void setIsAllowWindow(bool isAllow);
+    static bool getThisPhoneAutoConnect();
+    static void setThisPhoneAutoConnect(bool thisPhoneAutoConnect);
+    static bool getIsCanConnectDevice();
+    static void setIsCanConnectDevice(bool isCanConnect);
+    // Claims the PC-initiated connection slot: true when it was free and is now taken.
+    static bool tryClaimConnectDevice();
+    static std::string getConnectingDeviceType();
+    static void setConnectingDeviceType(const std::string& type);
+    static bool getIsCanPrimaryConnectDevice();
+    static void setIsCanPrimaryConnectDevice(bool isCan);
+    static bool tryClaimPrimaryConnectDevice();
+    static std::string getPrimaryConnectDeviceType();
+    static void setPrimaryConnectDeviceType(const std::string& type);
+    static bool getWlanConnState();
+    static void setWlanConnState(bool state);
+    static double getSsdpDetectedLastTime();
+    static void setSsdpDetectedLastTime(double time);
+
+    static std::string connectCenterServerUrl();
+    static void setConnectCenterServerUrl(const std::string& url);
+    static std::string pcsuiteHttpServerUrl();                // http://127.0.0.1:9199/
+    static std::string kesuConnHttpServerUrl();               // http://127.0.0.1:9197/
+    static std::string pcsuiteHttpServerSSDPQuerryAllUrl();   // .../SSDPQueryAll
+    static std::string pcsuiteHttpServerPushGattClientListUrl();
+    static std::string pcsuiteHttpIsConnectBusyUrl();         // .../isConnectBusy?deviceType=
+    static std::string pcsuiteHttpServerNotifySystemEventUrl();
+
+    // Resets the flags and counters to their start values (tests).
+    static void resetStateForTest();
+};
+
+}  // namespace kesu
