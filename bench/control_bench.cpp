@@ -1,0 +1,188 @@
+// Control API benchmark against the real binary: HeartBeat round trips over HTTP next to a
+// raw TCP echo round trip on loopback measured in the same run, then the idle CPU and RSS
+// of the service over a quiet period.
+//
+//   build/bench/control_bench [requests=2000] [idle_seconds=30]
+#include <arpa/inet.h>
+#include <httplib.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <fcntl.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+extern char** environ;
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+double percentile(std::vector<double> v, double p) {
+    std::sort(v.begin(), v.end());
+    return v[static_cast<size_t>(p * static_cast<double>(v.size() - 1))];
+}
+
+// A raw TCP echo on loopback: the floor for any request/answer exchange on this machine.
+std::vector<double> echoRoundTrips(int count, size_t payload) {
+    int listener = ::socket(AF_INET, SOCK_STREAM, 0);
+    sockaddr_in addr{};
+    addr.sin_family = AF_INET;
+    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    ::bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+    socklen_t len = sizeof addr;
+    ::getsockname(listener, reinterpret_cast<sockaddr*>(&addr), &len);
+    ::listen(listener, 1);
+    std::thread server([listener] {
+        int c = ::accept(listener, nullptr, nullptr);
+        int one = 1;
+        setsockopt(c, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
+        char buf[4096];
+        ssize_t n;
+        while ((n = ::read(c, buf, sizeof buf)) > 0) ::write(c, buf, static_cast<size_t>(n));
+        ::close(c);
+    });
+    int s = ::socket(AF_INET, SOCK_STREAM, 0);
+    int one = 1;
+    setsockopt(s, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
+    ::connect(s, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+    std::string msg(payload, 'x');
+    std::vector<char> buf(payload);
+    std::vector<double> out;
+    for (int i = 0; i < count; ++i) {
+        auto t0 = Clock::now();
+        ::write(s, msg.data(), msg.size());
+        size_t got = 0;
+        while (got < payload) {
+            ssize_t n = ::read(s, buf.data() + got, payload - got);
+            if (n <= 0) break;
+            got += static_cast<size_t>(n);
+        }
+        out.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+    }
+    ::close(s);
+    server.join();
+    ::close(listener);
+    return out;
+}
+
+long ticksOf(pid_t pid) {
+    std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+    std::string all((std::istreambuf_iterator<char>(in)), {});
+    auto close = all.rfind(')');
+    std::istringstream rest(all.substr(close + 2));
+    std::string field;
+    long utime = 0, stime = 0;
+    for (int i = 3; rest >> field; ++i) {
+        if (i == 14) utime = std::stol(field);
+        if (i == 15) {
+            stime = std::stol(field);
+            break;
+        }
+    }
+    return utime + stime;
+}
+
+long rssKiB(pid_t pid) {
+    std::ifstream in("/proc/" + std::to_string(pid) + "/status");
+    std::string line;
+    while (std::getline(in, line))
+        if (line.rfind("VmRSS:", 0) == 0) return std::stol(line.substr(6));
+    return -1;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    const int requests = argc > 1 ? std::atoi(argv[1]) : 2000;
+    const int idleSeconds = argc > 2 ? std::atoi(argv[2]) : 30;
+
+    char tmpl[] = "/tmp/kesu-bench-XXXXXX";
+    const std::string dir = mkdtemp(tmpl);
+    std::filesystem::create_directories(dir + "/home");
+    std::filesystem::create_directories(dir + "/root");
+    std::vector<std::string> envs;
+    for (char** e = environ; *e; ++e) {
+        std::string s(*e);
+        if (s.rfind("HOME=", 0) != 0 && s.rfind("KESU_ROOT=", 0) != 0) envs.push_back(s);
+    }
+    envs.push_back("HOME=" + dir + "/home");
+    envs.push_back("KESU_ROOT=" + dir + "/root");
+    std::vector<char*> cenv;
+    for (auto& e : envs) cenv.push_back(e.data());
+    cenv.push_back(nullptr);
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
+    pid_t pid = 0;
+    char* args[] = {const_cast<char*>(KESU_BINARY), nullptr};
+    if (posix_spawn(&pid, KESU_BINARY, &actions, nullptr, args, cenv.data()) != 0) {
+        std::fprintf(stderr, "cannot start %s\n", KESU_BINARY);
+        return 1;
+    }
+
+    httplib::Client client("127.0.0.1", 9197);
+    client.set_keep_alive(true);
+    client.set_tcp_nodelay(true);
+    const std::string body = R"(32#{"event":"HeartBeat","args":[]})";
+    // Wait for the server: the first answered request (bounded).
+    bool up = false;
+    for (int i = 0; i < 100 && !up; ++i) {
+        auto res = client.Post("/", body, "text/plain");
+        up = res && res->status == 200;
+        if (!up) std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    }
+    if (!up) {
+        std::fprintf(stderr, "service did not answer\n");
+        kill(pid, SIGKILL);
+        return 1;
+    }
+
+    std::vector<double> http;
+    std::string answer;
+    for (int i = 0; i < requests; ++i) {
+        auto t0 = Clock::now();
+        auto res = client.Post("/", body, "text/plain");
+        http.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+        if (!res) {
+            std::fprintf(stderr, "request %d failed\n", i);
+            break;
+        }
+        answer = res->body;
+    }
+    const auto echo = echoRoundTrips(requests, body.size() + 120);
+
+    const double hp50 = percentile(http, 0.5), hp99 = percentile(http, 0.99);
+    const double ep50 = percentile(echo, 0.5), ep99 = percentile(echo, 0.99);
+    std::printf("HeartBeat round trip (keep-alive, %d requests): p50 %.1f us  p99 %.1f us\n", requests, hp50, hp99);
+    std::printf("raw TCP echo round trip (same run):          p50 %.1f us  p99 %.1f us\n", ep50, ep99);
+    std::printf("ratio HeartBeat / echo:                       p50 %.2fx  p99 %.2fx\n", hp50 / ep50, hp99 / ep99);
+
+    const long hz = sysconf(_SC_CLK_TCK);
+    const long t0 = ticksOf(pid);
+    const long rss0 = rssKiB(pid);
+    std::this_thread::sleep_for(std::chrono::seconds(idleSeconds));
+    const long t1 = ticksOf(pid);
+    const long rss1 = rssKiB(pid);
+    std::printf("idle over %d s: CPU %.3f %%  RSS %ld KiB -> %ld KiB\n", idleSeconds,
+                100.0 * static_cast<double>(t1 - t0) / static_cast<double>(hz) / idleSeconds, rss0, rss1);
+
+    kill(pid, SIGTERM);
+    int status = 0;
+    waitpid(pid, &status, 0);
+    std::filesystem::remove_all(dir);
+    return 0;
+}

@@ -1,0 +1,44 @@
+// The local control server: one catch-all handler on 127.0.0.1 (port 9197 by default) that
+// decodes the length-prefixed envelope, dispatches it and answers "N#json" or an empty body.
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+
+namespace httplib {
+class Server;
+}
+
+namespace kesu {
+
+class HttpService {
+public:
+    HttpService() = default;
+    ~HttpService();
+    HttpService(const HttpService&) = delete;
+    HttpService& operator=(const HttpService&) = delete;
+
+    // The process-wide server every start, stop and restart goes through.
+    static HttpService& httpService();
+
+    // Creates and starts the server if there is none. False when it could not listen.
+    bool startHttpServic();
+    // Stops the server (if any) and waits for its listener to end.
+    void stop();
+    bool isRunning() const;
+    // The port actually listened on (useful when Config asks for port 0), 0 when stopped.
+    int port() const;
+
+    // The full answer body for a request body: "N#json" or "".
+    static std::string handleBody(const std::string& body);
+
+private:
+    mutable std::mutex mutex_;
+    std::unique_ptr<httplib::Server> serve_;
+    std::thread listener_;
+    int port_ = 0;
+};
+
+}  // namespace kesu

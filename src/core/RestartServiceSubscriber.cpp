@@ -1,0 +1,42 @@
+#include "core/RestartServiceSubscriber.h"
+
+#include "core/Config.h"
+#include "core/Json.h"
+#include "core/TimeUtil.h"
+#include "core/Utils.h"
+
+namespace kesu {
+
+RestartServiceSubscriber::RestartServiceSubscriber() : IEventSubscriber({"LogOnEvent"}) {}
+
+void RestartServiceSubscriber::notify(const std::string& eventName) {
+    if (!getIsNotify() && eventName == "LogOnEvent") dispatchDetached(eventName);
+}
+
+bool RestartServiceSubscriber::eventNotify(const std::string&) {
+    std::lock_guard<std::mutex> guard(lock);
+    setIsNotify(true);
+    if (Utils::getIsCanConnectDevice() && connServiceRunOutOfDate()) Utils::restartService();
+    setIsNotify(false);
+    return true;
+}
+
+bool RestartServiceSubscriber::connServiceRunOutOfDate() {
+    std::string content;
+    Utils::readFile(rootedPath(Config::current().versionFile), content);
+    if (content.empty()) return false;
+    const auto parsed = json::parse(content);
+    const std::string updateText = parsed ? json::str(*parsed, "updateTime") : std::string();
+    const auto updateTime = timeutil::parseLocal(updateText);
+    const auto now = timeutil::parseLocal(Utils::getNowTime());
+    if (!updateTime || !now) {
+        Utils::mPrintlog("[RestartServiceSubscriber::connServiceRunOutOfDate] no valid updateTime, keep running");
+        return false;
+    }
+    const long long days = timeutil::wholeDays(*updateTime, *now);
+    Utils::mPrintlog("[RestartServiceSubscriber::connServiceRunOutOfDate] Now connservice run " +
+                     std::to_string(days) + " day ");
+    return days > restartServiceDay;
+}
+
+}  // namespace kesu

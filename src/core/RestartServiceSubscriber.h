@@ -1,0 +1,22 @@
+// Restarts the whole service when the user unlocks the screen and this build was started
+// more than seven days ago (the version file's "updateTime"), unless a connection runs.
+#pragma once
+
+#include "events/IEventSubscriber.h"
+
+namespace kesu {
+
+class RestartServiceSubscriber : public IEventSubscriber {
+public:
+    RestartServiceSubscriber();
+
+    void notify(const std::string& eventName) override;
+    bool eventNotify(const std::string& eventName) override;
+    // True when the version file's update time lies more than `restartServiceDay` whole days
+    // back. A missing, empty or unparsable file counts as current.
+    bool connServiceRunOutOfDate();
+
+    const int restartServiceDay = 7;
+};
+
+}  // namespace kesu

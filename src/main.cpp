@@ -1,0 +1,3 @@
+#include "core/ServiceMain.h"
+
+int main() { return kesu::runService(); }

@@ -1,0 +1,114 @@
+// Decoding of control request bodies and the framing of answers.
+#include <gtest/gtest.h>
+
+#include "control/HttpService.h"
+#include "control/RequestHandle.h"
+#include "control/ResponseHandler.h"
+#include "core/Text.h"
+
+namespace kesu {
+namespace {
+
+requestObj decode(const std::string& body) { return RequestHandle().format(body); }
+
+TEST(Envelope, LengthPrefixIsOptionalAndIgnored) {
+    const std::string envelope = R"({"event":"queryAdapter","args":{"k":"v"},"app":"pcsuite"})";
+    for (const std::string& body : {envelope, "57#" + envelope, "1#" + envelope, "#" + envelope}) {
+        const requestObj r = decode(body);
+        EXPECT_EQ(r.event, RequestEvent::queryAdapter) << body;
+        EXPECT_EQ(r.params, Json({{"k", "v"}})) << body;
+        EXPECT_EQ(r.sourec, std::optional<std::string>("pcsuite")) << body;
+    }
+    // Without a prefix, a "#" inside the JSON cuts it: only the part after it is parsed.
+    EXPECT_EQ(decode(R"({"event":"HeartBeat","args":["a#b"]})").event, RequestEvent::unknown);
+    EXPECT_EQ(decode(R"(9#{"event":"HeartBeat","args":["a#b"]})").event, RequestEvent::HeartBeat);
+    // Only a number: nothing to decode.
+    EXPECT_EQ(decode("57#").event, RequestEvent::unknown);
+    EXPECT_EQ(decode("###").event, RequestEvent::unknown);
+}
+
+TEST(Envelope, CmdFormTakesParamNeverArgs) {
+    const requestObj a = decode(R"({"cmd":"queryAdapter","param":{}})");
+    const requestObj b = decode(R"({"event":"queryAdapter","args":{}})");
+    EXPECT_EQ(a.event, b.event);
+    EXPECT_EQ(a.params, b.params);
+    EXPECT_TRUE(a.params.is_object());
+
+    const requestObj c = decode(R"({"event":"","cmd":"HeartBeat","args":{"x":1}})");
+    EXPECT_EQ(c.event, RequestEvent::HeartBeat);
+    EXPECT_EQ(c.params, Json::array());
+}
+
+TEST(Envelope, ParamsByJsonTypeAndAppOnlyWhenString) {
+    EXPECT_EQ(decode(R"({"event":"kpush","args":"text"})").params, Json("text"));
+    EXPECT_EQ(decode(R"({"event":"kpush","args":[1,"2"]})").params, Json::parse(R"([1,"2"])"));
+    EXPECT_EQ(decode(R"({"event":"kpush","args":5})").params, Json::array());
+    EXPECT_EQ(decode(R"({"event":"kpush","args":null})").params, Json::array());
+    EXPECT_EQ(decode(R"({"event":"kpush"})").params, Json::array());
+    EXPECT_FALSE(decode(R"({"event":"kpush","app":7})").sourec.has_value());
+    EXPECT_FALSE(decode(R"({"event":"kpush"})").sourec.has_value());
+}
+
+TEST(Envelope, EventNamesMatchExactly) {
+    EXPECT_EQ(decode(R"({"event":"preconnect_preconnect-connect"})").event,
+              RequestEvent::preconnect_preconnect_connect);
+    EXPECT_EQ(decode(R"({"event":"preconnect_preconnect_connect"})").event, RequestEvent::unknown);
+    EXPECT_EQ(decode(R"({"event":"heartbeat"})").event, RequestEvent::unknown);
+    EXPECT_EQ(decode(R"({"event":" HeartBeat"})").event, RequestEvent::unknown);
+    EXPECT_EQ(decode(R"({"event":42})").event, RequestEvent::unknown);
+    // Every wire name decodes to its own case.
+    for (RequestEvent e : allValues()) {
+        Json envelope = {{"event", std::string(rawValue(e))}};
+        EXPECT_EQ(decode(envelope.dump()).event, e) << rawValue(e);
+    }
+}
+
+TEST(Envelope, HostileTextDecodesAsUnknown) {
+    EXPECT_EQ(decode("not json").event, RequestEvent::unknown);
+    EXPECT_EQ(decode("[1,2]").event, RequestEvent::unknown);
+    EXPECT_EQ(decode(std::string(100000, '[')).event, RequestEvent::unknown);
+    EXPECT_EQ(decode("{\"event\":\"HeartBeat\",\"args\":" + std::string(5000, '[') + std::string(5000, ']') + "}")
+                  .event,
+              RequestEvent::unknown);
+    EXPECT_EQ(decode("{\"event\":\"HeartBeat\",\"args\":" + std::string(20, '[') + std::string(20, ']') + "}")
+                  .event,
+              RequestEvent::HeartBeat);
+}
+
+TEST(Envelope, BodyBytesDropFFAndRejectInvalidUtf8) {
+    EXPECT_EQ(ResponseHandler::switchUint8ArrToString("\xff{\"ev\xff\xff" "ent\":1}\xff"), "{\"event\":1}");
+    EXPECT_EQ(ResponseHandler::switchUint8ArrToString("\xc3\x28"), "");
+    EXPECT_EQ(ResponseHandler::switchUint8ArrToString("\xe4\xbd\xa0\xe5\xa5\xbd"), "\xe4\xbd\xa0\xe5\xa5\xbd");
+    // 0xFF inside an otherwise valid body disappears before decoding.
+    EXPECT_EQ(HttpService::handleBody("\xff#{\"event\":\"Heart\xff" "Beat\"}").empty(), false);
+}
+
+TEST(Envelope, AnswersAreCountedInUserPerceivedCharacters) {
+    EXPECT_EQ(text::lengthPrefixed(""), "");
+    const std::string ascii(42, 'a');
+    EXPECT_EQ(text::lengthPrefixed(ascii), "42#" + ascii);
+    // 你好 is 2 characters in 6 bytes; a family emoji joined by ZWJ is one character.
+    EXPECT_EQ(text::lengthPrefixed("\xe4\xbd\xa0\xe5\xa5\xbd"), "2#\xe4\xbd\xa0\xe5\xa5\xbd");
+    const std::string family = "\xf0\x9f\x91\xa8\xe2\x80\x8d\xf0\x9f\x91\xa9\xe2\x80\x8d\xf0\x9f\x91\xa7";
+    EXPECT_EQ(text::lengthPrefixed("{" + family + "}"), "3#{" + family + "}");
+    // "e" + combining acute accent is one character.
+    EXPECT_EQ(text::graphemeCount("e\xcc\x81"), 1u);
+}
+
+TEST(Dispatcher, HeartbeatAndEmptyAnswers) {
+    const std::string answer = HttpService::handleBody(R"({"event":"HeartBeat","args":[]})");
+    const auto hash = answer.find('#');
+    ASSERT_NE(hash, std::string::npos);
+    const Json body = Json::parse(answer.substr(hash + 1));
+    EXPECT_EQ(body, Json({{"error", 0}, {"error_message", ""}, {"data", "Alive"}}));
+    EXPECT_EQ(answer.substr(0, hash), std::to_string(answer.size() - hash - 1));
+
+    for (const char* event : {"queryAll", "stopSSDPScan", "openWifi", "unknown", "LaunchSuccess", "AlreadyStart",
+                              "noSuchEvent"}) {
+        EXPECT_EQ(HttpService::handleBody(Json({{"event", event}}).dump()), "") << event;
+    }
+    EXPECT_EQ(HttpService::handleBody(""), "");
+}
+
+}  // namespace
+}  // namespace kesu

@@ -1,0 +1,192 @@
+// Log lines and files, log clean-up, the version file and the date helpers.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "core/Json.h"
+#include "core/TimeUtil.h"
+#include "core/Utils.h"
+#include "support/TestSupport.h"
+
+namespace kesu {
+namespace {
+
+using namespace std::chrono_literals;
+namespace fs = std::filesystem;
+
+// Sets the zone for the scope (TZ + tzset).
+class ScopedZone {
+public:
+    explicit ScopedZone(const char* zone) : env_("TZ", std::string(zone)) { tzset(); }
+
+private:
+    struct Reload {
+        ~Reload() { tzset(); }  // runs after TZ is put back
+    } reload_;
+    test::ScopedEnv env_;
+};
+
+// Fixed clock for the scope.
+class ScopedClock {
+public:
+    explicit ScopedClock(Utils::Clock::time_point t) { Utils::setClock([t] { return t; }); }
+    ~ScopedClock() { Utils::setClock({}); }
+};
+
+Utils::Clock::time_point utc(int y, int mo, int d, int h, int mi, int s, int ms) {
+    std::tm tm{};
+    tm.tm_year = y - 1900;
+    tm.tm_mon = mo - 1;
+    tm.tm_mday = d;
+    tm.tm_hour = h;
+    tm.tm_min = mi;
+    tm.tm_sec = s;
+    return Utils::Clock::from_time_t(timegm(&tm)) + std::chrono::milliseconds(ms);
+}
+
+class LogFiles : public ::testing::Test {
+protected:
+    void TearDown() override { Utils::closeLog(); }
+    test::HermeticEnv env;
+    std::string file(const std::string& date) const {
+        return Utils::logDirectory() + "/KesuConnService_" + date + ".log";
+    }
+};
+
+TEST_F(LogFiles, LinesGoToTheFileOfTheGmtDate) {
+    ScopedZone zone("Asia/Shanghai");  // eight hours ahead of GMT
+    {
+        ScopedClock clock(utc(2026, 12, 3, 23, 59, 59, 900));
+        Utils::mPrintlog("[LogTest] before midnight");
+    }
+    {
+        // 00:30 local on the 4th is still the 3rd in GMT.
+        ScopedClock clock(utc(2026, 12, 3, 16, 30, 0, 0));
+        Utils::mPrintlog("[LogTest] local morning");
+    }
+    {
+        ScopedClock clock(utc(2026, 12, 4, 0, 0, 0, 100));
+        Utils::mPrintlog("[LogTest] after midnight");
+    }
+    Utils::closeLog();
+    const std::string day3 = test::readAll(file("2026-12-03"));
+    const std::string day4 = test::readAll(file("2026-12-04"));
+    EXPECT_NE(day3.find("[2026-12-04 07:59:59.900][logLoop] [LogTest] before midnight\n"), std::string::npos)
+        << day3;
+    EXPECT_NE(day3.find("[logLoop] [LogTest] local morning\n"), std::string::npos) << day3;
+    EXPECT_EQ(day3.find("after midnight"), std::string::npos);
+    EXPECT_NE(day4.find("[2026-12-04 08:00:00.100][logLoop] [LogTest] after midnight\n"), std::string::npos)
+        << day4;
+}
+
+TEST_F(LogFiles, ConcurrentLinesNeverInterleave) {
+    constexpr int kThreads = 8, kLines = 200;
+    std::vector<std::thread> threads;
+    for (int t = 0; t < kThreads; ++t)
+        threads.emplace_back([t] {
+            for (int i = 0; i < kLines; ++i)
+                Utils::mPrintlog("[LogTest] thread " + std::to_string(t) + " line " + std::to_string(i) + " " +
+                                 std::string(100, static_cast<char>('a' + t)));
+        });
+    for (auto& th : threads) th.join();
+    Utils::closeLog();
+    const std::string log = test::readAll(Utils::logFilePath(Utils::now()));
+    int count = 0;
+    std::size_t start = 0;
+    while (start < log.size()) {
+        std::size_t end = log.find('\n', start);
+        ASSERT_NE(end, std::string::npos);
+        const std::string line = log.substr(start, end - start);
+        const auto pos = line.find("[logLoop] [LogTest] thread ");
+        ASSERT_NE(pos, std::string::npos) << line;
+        const char t = line[pos + 27];
+        EXPECT_EQ(line.substr(line.size() - 100), std::string(100, static_cast<char>('a' + (t - '0')))) << line;
+        ++count;
+        start = end + 1;
+    }
+    EXPECT_EQ(count, kThreads * kLines);
+}
+
+TEST_F(LogFiles, UnwritableLogDirectoryStillLogsToStandardOutput) {
+    // The log directory's place is taken by a file: nothing can be opened there.
+    fs::create_directories(fs::path(Utils::logDirectory()).parent_path());
+    std::ofstream(Utils::logDirectory()) << "not a directory";
+    testing::internal::CaptureStdout();
+    Utils::mPrintlog("[LogTest] to stdout only");
+    const std::string out = testing::internal::GetCapturedStdout();
+    EXPECT_NE(out.find("[logLoop] [LogTest] to stdout only"), std::string::npos);
+}
+
+TEST_F(LogFiles, OldFilesGoAfterFourteenDays) {
+    ScopedClock clock(utc(2026, 12, 20, 12, 0, 0, 0));
+    const std::string dir = Utils::logDirectory();
+    fs::create_directories(dir);
+    auto touch = [&](const std::string& name) { std::ofstream(dir + "/" + name) << "x"; };
+    touch("KesuConnService_2026-12-06.log");  // 14 days: stays
+    touch("KesuConnService_2026-12-05.log");  // 15 days: goes
+    touch("KesuConnService_2025-01-01.log");  // goes
+    touch("KesuConnService_notadate.log");    // stays
+    touch("x.log.KesuConnService_1");         // no date range: stays
+    touch("other.txt");                       // stays
+    fs::create_directories(dir + "/KesuConnService_2020-01-01.log");  // a directory: stays
+
+    Utils::deleteOldLogFile();
+
+    EXPECT_TRUE(fs::exists(dir + "/KesuConnService_2026-12-06.log"));
+    EXPECT_FALSE(fs::exists(dir + "/KesuConnService_2026-12-05.log"));
+    EXPECT_FALSE(fs::exists(dir + "/KesuConnService_2025-01-01.log"));
+    EXPECT_TRUE(fs::exists(dir + "/KesuConnService_notadate.log"));
+    EXPECT_TRUE(fs::exists(dir + "/x.log.KesuConnService_1"));
+    EXPECT_TRUE(fs::exists(dir + "/other.txt"));
+    EXPECT_TRUE(fs::is_directory(dir + "/KesuConnService_2020-01-01.log"));
+    Utils::closeLog();
+    const std::string log = test::readAll(file("2026-12-20"));
+    EXPECT_NE(log.find("[Utils::deleteOldLogFile] KesuConnService_2026-12-05.log is time out, success to remove file."),
+              std::string::npos)
+        << log;
+}
+
+TEST_F(LogFiles, MissingLogDirectoryIsReported) {
+    testing::internal::CaptureStdout();
+    Utils::deleteOldLogFile();
+    EXPECT_NE(testing::internal::GetCapturedStdout().find("get file path error: "), std::string::npos);
+}
+
+TEST_F(LogFiles, VersionFileHoldsVersionAndStartTime) {
+    ScopedClock clock(utc(2026, 12, 4, 10, 0, 0, 250));
+    Utils::writeConnServiceVersion(Utils::versionCode);
+    const std::string path = rootedPath(Config::current().versionFile);
+    EXPECT_EQ(path.rfind(env.root(), 0), 0u) << "written below KESU_ROOT";
+    const auto content = Json::parse(test::readAll(path));
+    EXPECT_EQ(content.size(), 2u);
+    EXPECT_EQ(content["version"], "3.6.1.0");
+    EXPECT_EQ(content["updateTime"], timeutil::formatLocal(utc(2026, 12, 4, 10, 0, 0, 250)));
+    // Rewriting replaces the content (a longer old file must not leave a tail).
+    std::ofstream(path) << std::string(500, ' ') << "junk";
+    Utils::writeConnServiceVersion("1");
+    EXPECT_EQ(Json::parse(test::readAll(path))["version"], "1");
+}
+
+TEST(TimeHelpers, FormatsParsesAndCountsDays) {
+    ScopedZone zone("Europe/Berlin");
+    const auto t = timeutil::parseLocal("2026-03-28 12:34:56.789");
+    ASSERT_TRUE(t);
+    EXPECT_EQ(timeutil::formatLocal(*t), "2026-03-28 12:34:56.789");
+    EXPECT_EQ(Utils::stringToTimestamp("2026-03-28 12:34:56.789"),
+              std::chrono::floor<std::chrono::seconds>(t->time_since_epoch()).count());
+    for (const char* bad : {"", "2026-03-28 12:34:56", "2026-02-30 00:00:00.000", "2026-13-01 00:00:00.000",
+                            "2026-03-28T12:34:56.789", "2026-03-28 12:34:56.789x", "abcd-ef-gh ij:kl:mn.opq"})
+        EXPECT_EQ(Utils::stringToTimestamp(bad), 0) << bad;
+
+    // Across the spring clock change a calendar day is 23 hours.
+    const auto before = *timeutil::parseLocal("2026-03-28 12:00:00.000");
+    EXPECT_EQ(timeutil::wholeDays(before, *timeutil::parseLocal("2026-03-29 12:00:00.000")), 1);
+    EXPECT_EQ(timeutil::wholeDays(before, *timeutil::parseLocal("2026-03-29 11:59:59.999")), 0);
+    EXPECT_EQ(timeutil::wholeDays(before, *timeutil::parseLocal("2026-04-05 12:00:00.000")), 8);
+    EXPECT_EQ(timeutil::wholeDays(*timeutil::parseLocal("2026-04-05 12:00:00.000"), before), -8);
+}
+
+}  // namespace
+}  // namespace kesu

@@ -1,0 +1,152 @@
+// Single-instance rule, the seven-day restart rule and the control-server watchdog.
+#include <gtest/gtest.h>
+#include <httplib.h>
+#include <sys/wait.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "control/HttpService.h"
+#include "core/HttpAliveCheck.h"
+#include "core/RestartServiceSubscriber.h"
+#include "core/SingleInstance.h"
+#include "core/Json.h"
+#include "core/TimeUtil.h"
+#include "core/Utils.h"
+#include "support/ServiceProcess.h"
+#include "support/TestSupport.h"
+
+namespace kesu {
+namespace {
+
+using namespace std::chrono_literals;
+
+TEST(SingleInstance, CountsExactlyTwoMatchingLines) {
+    const std::string header = "    PID TTY          TIME CMD\n      1 ?        00:00:01 init\n";
+    const std::string self = "   4242 ?        00:00:00 KesuConnService\n";
+    const std::string other = "   1234 ?        00:00:09 KesuConnService\n";
+    const std::string grep = "   5555 pts/0    00:00:00 grep KesuConnService\n";
+    EXPECT_EQ(countProcessLines(header, "KesuConnService"), 0);
+    EXPECT_EQ(countProcessLines(header + self, "KesuConnService"), 1);
+    EXPECT_EQ(countProcessLines(header + self + other, "KesuConnService"), 2);
+    EXPECT_EQ(countProcessLines(header + self + other + grep, "KesuConnService"), 2);
+    EXPECT_EQ(countProcessLines(header + self + other + other, "KesuConnService"), 3);
+    // Last line without a newline still counts.
+    EXPECT_EQ(countProcessLines("1 ? 0 KesuConnService", "KesuConnService"), 1);
+}
+
+class RestartRule : public ::testing::Test {
+protected:
+    void SetUp() override { Utils::resetStateForTest(); }
+    void TearDown() override {
+        Utils::setClock({});
+        Utils::resetStateForTest();
+        Utils::closeLog();
+    }
+    void writeVersion(const std::string& content) {
+        const std::string path = rootedPath(Config::current().versionFile);
+        std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+        std::ofstream(path) << content;
+    }
+    void versionUpdated(const std::string& updateTime) {
+        writeVersion(Json({{"version", "3.6.1.0"}, {"updateTime", updateTime}}).dump(2));
+    }
+    void now(const std::string& localTime) {
+        const auto t = *timeutil::parseLocal(localTime);
+        Utils::setClock([t] { return t; });
+    }
+    test::HermeticEnv env;
+};
+
+TEST_F(RestartRule, RestartsAfterMoreThanSevenWholeDays) {
+    RestartServiceSubscriber subscriber;
+    versionUpdated("2026-11-26 10:00:00.000");
+    now("2026-12-03 10:00:00.000");  // exactly 7 days
+    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
+    now("2026-12-04 09:59:59.999");  // 7 days and almost 24 hours
+    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
+    now("2026-12-04 10:00:00.000");  // 8 days
+    EXPECT_TRUE(subscriber.connServiceRunOutOfDate());
+    // A version file from the future is not out of date.
+    now("2026-11-01 10:00:00.000");
+    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
+}
+
+TEST_F(RestartRule, UnusableVersionFileCountsAsCurrent) {
+    RestartServiceSubscriber subscriber;
+    now("2026-12-04 10:00:00.000");
+    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());  // missing
+    for (const std::string& content :
+         {std::string(""), std::string("not json"), std::string(R"({"version":"3.6.1.0"})"),
+          std::string(R"({"updateTime":"2020-01-01"})"), std::string(R"({"updateTime":12345})"),
+          std::string(R"(["2020-01-01 00:00:00.000"])")}) {
+        writeVersion(content);
+        EXPECT_FALSE(subscriber.connServiceRunOutOfDate()) << content;
+    }
+}
+
+TEST_F(RestartRule, OnlyLogOnWithoutConnectionTriggersTheCheck) {
+    // An out-of-date version file whose restart target cannot run: the service logs the
+    // attempt and keeps running.
+    versionUpdated("2026-11-01 10:00:00.000");
+    now("2026-12-04 10:00:00.000");
+    Config::current().serviceExecutable = "/nonexistent/KesuConnService";
+    auto subscriber = std::make_shared<RestartServiceSubscriber>();
+
+    for (const char* other : {"LogOutEvent", "WifiOpenEvent", "PcsuiteEvent", "logonevent"}) subscriber->notify(other);
+    ASSERT_TRUE(subscriber->waitIdle(5s));
+    Utils::closeLog();
+    std::string log = test::readAll(Utils::logFilePath(Utils::now()));
+    EXPECT_EQ(log.find("Now connservice run"), std::string::npos) << log;
+
+    Utils::setIsCanConnectDevice(false);  // a connection in progress: no check
+    subscriber->notify("LogOnEvent");
+    ASSERT_TRUE(subscriber->waitIdle(5s));
+    Utils::closeLog();
+    log = test::readAll(Utils::logFilePath(Utils::now()));
+    EXPECT_EQ(log.find("restart KesuConnService"), std::string::npos) << log;
+    EXPECT_FALSE(subscriber->getIsNotify());
+}
+
+// The restart replaces the process image in place: the restarted program runs with the
+// same process id, so it never sees its predecessor in the process list.
+TEST(SelfRestart, ReplacesTheProcessImageInPlace) {
+    test::TempDir dir;
+    const std::string root = dir.str() + "/root";
+    const std::string exe =
+        root + "/Applications/pcsuite.app/Contents/Resources/kesuesService/KesuConnService/KesuConnService";
+    const std::string marker = dir.str() + "/restarted";
+    dir.write("root/Applications/pcsuite.app/Contents/Resources/kesuesService/KesuConnService/KesuConnService",
+              "#!/bin/sh\necho $$ > '" + marker + "'\n");
+    std::filesystem::permissions(exe, std::filesystem::perms::owner_all);
+
+    test::ServiceProcess probe(KESU_RESTART_PROBE, {}, {{"HOME", dir.str()}, {"KESU_ROOT", root}});
+    EXPECT_EQ(probe.waitExit(20s), 0) << probe.output();
+    EXPECT_EQ(test::readAll(marker), std::to_string(probe.pid()) + "\n");
+}
+
+TEST(Watchdog, RestartsAServerThatStoppedAnswering) {
+    test::HermeticEnv env;
+    Config::current().controlPort = test::freeTcpPort();
+    Config::current().httpWatchdogPeriod = 100ms;
+    Config::current().httpRestartPause = 10ms;
+    Config::current().httpAliveTimeout = 2s;
+    ASSERT_TRUE(HttpService::httpService().startHttpServic());
+    EXPECT_TRUE(Utils::isHttpAlive());
+
+    HttpAliveCheck watchdog;  // the real probe: a HeartBeat to our own server
+    HttpService::httpService().stop();
+    EXPECT_FALSE(Utils::isHttpAlive());
+    ASSERT_TRUE(watchdog.waitForRestarts(1, 10s));
+    EXPECT_TRUE(Utils::isHttpAlive());
+    watchdog.stop();
+    // A healthy server is left alone.
+    HttpAliveCheck quiet;
+    EXPECT_FALSE(quiet.waitForRestarts(1, 500ms));
+    quiet.stop();
+    HttpService::httpService().stop();
+    Utils::closeLog();
+}
+
+}  // namespace
+}  // namespace kesu
