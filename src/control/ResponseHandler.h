@@ -18,6 +18,9 @@ public:
     // {"error": error, "error_message": message} pretty-printed.
     static std::string response(int error, const std::string& message);
     static Json responseObject(int error, const std::string& message);
+    // The network adapter report and the system report (firewall and related PC facts).
+    static std::string structureQueryAdapterRes();
+    static std::string querySystemStatus();
 };
 
 }  // namespace kesu

@@ -8,11 +8,12 @@
 namespace kesu {
 
 class IEventSubscriber;
+class EventDetected;
 
 class ServiceManager {
 public:
-    ServiceManager() = default;
-    ~ServiceManager();
+    ServiceManager();
+    ~ServiceManager();  // defined where EventDetected is complete
     ServiceManager(const ServiceManager&) = delete;
     ServiceManager& operator=(const ServiceManager&) = delete;
 
@@ -23,6 +24,7 @@ public:
 private:
     bool started_ = false;
     std::vector<std::shared_ptr<IEventSubscriber>> subscribers_;
+    std::unique_ptr<EventDetected> eventDetected_;
 };
 
 }  // namespace kesu

@@ -1,0 +1,17 @@
+// Handles push messages relayed by the PC suite.
+#pragma once
+
+#include <string>
+
+#include "control/RequestEvent.h"
+
+namespace kesu {
+
+class KPushReceiveEventHandler {
+public:
+    static KPushReceiveEventHandler& instance();
+    // The answer text for one relayed push message.
+    std::string kpushInfoHandler(const requestObj& request);
+};
+
+}  // namespace kesu
