@@ -45,6 +45,7 @@ bool HttpService::startHttpServic() {
     server->set_read_timeout(config.controlReadTimeout);
     server->set_write_timeout(config.controlReadTimeout);
     server->set_keep_alive_max_count(100);
+    server->set_tcp_nodelay(true);  // the answer goes out at once, not after a delayed ACK
     // Plain SO_REUSEADDR: a second listener must never share the port.
     server->set_socket_options([](int sock) {
         int yes = 1;
