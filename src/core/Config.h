@@ -24,8 +24,21 @@ struct Config {
 
     // Phone-side TCP port (both directions) and LAN discovery.
     int phoneTcpPort = 10191;
+    // Largest phone frame body accepted from a phone; a frame announcing more is dropped.
+    std::size_t phoneFrameMaxBody = 1 << 20;
     int ssdpPort = 2200;
     std::string ssdpGroup = "239.255.255.250";
+    // Discovered-device table: an entry not heard for longer than the expiry goes at the
+    // next sweep; at most ssdpMaxDevices entries are kept (the one heard longest ago makes
+    // room for a new one).
+    std::chrono::milliseconds ssdpDeviceExpiry{30000};
+    std::size_t ssdpMaxDevices = 1024;
+
+    // How long preconnect_startScan waits for the cloud device list to fill the registry.
+    std::chrono::milliseconds preconnectScanWait{5000};
+
+    // Screen-lock watcher period.
+    std::chrono::milliseconds screenLockPeriod{3000};
 
     // Watchdog of the control server.
     std::chrono::milliseconds httpWatchdogPeriod{120000};
@@ -35,6 +48,12 @@ struct Config {
     // Outbound HTTP.
     std::chrono::milliseconds httpRequestTimeout{20000};
     std::chrono::milliseconds http429Pause{3000};
+    // Requests that wait for the answer without a time-out of their own (bury points, busy
+    // checks, device lists, system events) use the HTTP client's default limit.
+    std::chrono::milliseconds httpWaitTimeout{60000};
+    std::size_t httpMaxAnswerBody = 16 << 20;  // larger answers are dropped unread
+    std::string caCertPath;                    // extra trusted CA file for https; empty: system store
+    std::string buryPointUdpHost = "127.0.0.1";
 
     // Fixed paths of the PC suite's bundle, before KESU_ROOT is applied.
     std::string versionFile =
@@ -43,7 +62,22 @@ struct Config {
         "/Applications/pcsuite.app/Contents/Resources/kesuesService/KesuConnService/KesuConnService";
     std::string switchHostIni = "/Library/Preferences/pcsuite/switch_host.ini";
 
+    // PC suite's account database: the monitor's modification-time poll, and how long one
+    // read waits for the PC suite's write lock before it gives up (the old values stay).
+    std::chrono::milliseconds fileMonitorPeriod{3000};
+    std::chrono::milliseconds databaseBusyTimeout{1000};
+
     std::string defaultConnectCenterUrl = "https://connect-center.kesu.example/";
+
+    // Operating-system locations and limits of the Linux platform layer (tests may point the
+    // locations at a prepared tree). A system tool that is missing or fails is not asked
+    // again before platformToolRetry has passed.
+    std::string sysfsRoot = "/sys";
+    std::string procRoot = "/proc";
+    std::string machineInfoFile = "/etc/machine-info";
+    std::string ufwConfigFile = "/etc/ufw/ufw.conf";
+    std::chrono::milliseconds platformCommandTimeout{2000};
+    std::chrono::milliseconds platformToolRetry{60000};
 
     // The process-wide configuration. Set it up before anything is started.
     static Config& current();

@@ -1,0 +1,44 @@
+// A connected UDP client socket that sends single datagrams to a local peer (the telemetry
+// collector, the push client): the datagram variant of ISocketBase.
+#pragma once
+
+#include <asio/io_context.hpp>
+#include <asio/ip/udp.hpp>
+#include <cstdint>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "connect/ISocketBase.h"
+
+namespace kesu {
+
+class UdpSocketBase : public ISocketBase {
+public:
+    UdpSocketBase() = default;
+    ~UdpSocketBase() override;
+    UdpSocketBase(const UdpSocketBase&) = delete;
+    UdpSocketBase& operator=(const UdpSocketBase&) = delete;
+
+    // Connects the socket to ip:port (an address literal or a host name). False, with a log
+    // line, when that fails. The time-out is not used: a datagram connect does not wait.
+    bool initial(std::uint16_t port, const std::string& ip, int timeout) override;
+    // Closes the socket; later sends fail.
+    bool close() override;
+    // Sends `data` as one datagram without waiting: true when the system took it.
+    bool sendMsg(double time, const Bytes& data) override;
+    // Datagram links here only send: answers nothing and returns true.
+    bool recvMsg(double time, Bytes& data, int& errorCode) override;
+    bool isSocketNull() override;
+    std::string getSokcetType() override;  // "udp"
+
+    // Creates the (not yet opened) socket; initial() calls it when needed.
+    virtual void initClientSocket();
+
+protected:
+    std::mutex mutex_;  // guards `socket`
+    asio::io_context io_;
+    std::optional<asio::ip::udp::socket> socket;
+};
+
+}  // namespace kesu

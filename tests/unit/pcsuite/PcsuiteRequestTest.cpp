@@ -1,0 +1,237 @@
+// Every request the service sends to the PC suite (and the HeartBeat to its own control
+// server), against a real stub server: method, path, body and framing, how each answer is
+// judged, and what a PC suite that is down or hung gives.
+#include <gtest/gtest.h>
+
+#include "control/HttpService.h"
+#include "core/Text.h"
+#include "core/Utils.h"
+#include "pcsuite/PcsuiteRequest.h"
+#include "support/StubPcSuite.h"
+#include "support/TestSupport.h"
+
+namespace kesu {
+namespace {
+
+using namespace std::chrono_literals;
+using test::CannedAnswer;
+
+std::string todaysLog() { return test::readAll(Utils::logFilePath(Utils::now())); }
+
+// The JSON inside an "N#json" body, after checking that N counts its characters.
+Json unframed(const std::string& body) {
+    const auto hash = body.find('#');
+    EXPECT_NE(hash, std::string::npos) << body;
+    if (hash == std::string::npos) return Json();
+    const std::string json = body.substr(hash + 1);
+    EXPECT_EQ(body.substr(0, hash), std::to_string(text::graphemeCount(json))) << body;
+    return Json::parse(json);
+}
+
+class PcsuiteRequestTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        env.config().httpRequestTimeout = 2s;
+        env.config().httpWaitTimeout = 2s;
+        env.config().httpAliveTimeout = 2s;
+        env.config().http429Pause = 10ms;
+        stub.pointPcsuiteHere(env.config());
+    }
+    void TearDown() override { Utils::closeLog(); }
+    test::HermeticEnv env;
+    test::StubPcSuite stub;
+};
+
+TEST_F(PcsuiteRequestTest, PcDeviceInfoAndConnectDeviceAcceptOnlyTheTextCode) {
+    stub.setAnswer("/pcDeviceInfo", {200, R"({"code":"000000","data":{"deviceId":"PC-1","version":"3.7.0"}})"});
+    auto info = PcsuiteRequest::getPcDeviceInfo();
+    ASSERT_TRUE(info.has_value());
+    EXPECT_EQ(json::str(json::object(*info, "data"), "deviceId"), "PC-1");
+    auto requests = stub.requestsTo("/pcDeviceInfo");
+    ASSERT_EQ(requests.size(), 1u);
+    EXPECT_EQ(requests[0].method, "POST");
+    EXPECT_EQ(requests[0].body, "");
+    EXPECT_EQ(requests[0].header("Content-Type"), "application/json");
+    EXPECT_NE(todaysLog().find("[PcsuiteRequest][responseIntercept] [INTERACTION][PCSUITE_TO_CONNSERVER] path: "
+                               "pcDeviceInfo, response: "),
+              std::string::npos);
+
+    stub.setAnswer("/connectDevice", {200, R"({"code":"000000"})"});
+    const std::map<std::string, std::string> request{
+        {"requestSource", "preconnect"}, {"eventId", "12345678"}, {"deviceId", "a1b2"}};
+    EXPECT_TRUE(PcsuiteRequest::startConnectPreDevice(request).has_value());
+    requests = stub.requestsTo("/connectDevice");
+    ASSERT_EQ(requests.size(), 1u);
+    EXPECT_EQ(requests[0].method, "POST");
+    EXPECT_EQ(Json::parse(requests[0].body),
+              Json::parse(R"({"requestSource":"preconnect","eventId":"12345678","deviceId":"a1b2"})"));
+
+    // Anything but the six-character text is a refusal: the number 0, another code, no code,
+    // an answer that is not JSON.
+    for (const std::string body : {R"({"code":0,"data":{"deviceId":"PC-1"}})", R"({"code":"000001"})",
+                                   R"({"code":"0"})", R"({"data":{}})", "000000"}) {
+        stub.setAnswer("/pcDeviceInfo", {200, body});
+        EXPECT_FALSE(PcsuiteRequest::getPcDeviceInfo().has_value()) << body;
+    }
+    EXPECT_NE(todaysLog().find(R"([PcsuiteRequest][responseIntercept] path: pcDeviceInfo request err: {"code":0,)"),
+              std::string::npos);
+}
+
+TEST(PcsuiteEventFraming, RebuildEventDataCountsUserPerceivedCharacters) {
+    std::string framed = "untouched";
+    EXPECT_FALSE(Utils::RebuildEventData("", framed));
+    EXPECT_EQ(framed, "untouched");
+    ASSERT_TRUE(Utils::RebuildEventData(R"({"event":"HeartBeat","args":[0]})", framed));
+    EXPECT_EQ(framed, R"(32#{"event":"HeartBeat","args":[0]})");
+    // "é" as e + combining accent and a flag are one character each, not 3 and 8 bytes.
+    ASSERT_TRUE(Utils::RebuildEventData("{\"n\":\"e\xcc\x81\xf0\x9f\x87\xa9\xf0\x9f\x87\xaa\"}", framed));
+    EXPECT_EQ(framed.substr(0, 3), "10#");
+}
+
+TEST_F(PcsuiteRequestTest, BuryPointIsPostedUnframedAndJudgedByItsCode) {
+    const std::string record = R"([{"type":1,"eventId":"W688|10308","params":{"net_type":1,"state":0}}])";
+    EXPECT_TRUE(Utils::sendBuryPoint(record));
+    auto requests = stub.requestsTo("/buryPoint");
+    ASSERT_EQ(requests.size(), 1u);
+    EXPECT_EQ(requests[0].method, "POST");
+    EXPECT_EQ(requests[0].body, record);
+
+    stub.setAnswer("/buryPoint", {200, R"({"code":"000001","data":"unknown event"})"});
+    EXPECT_FALSE(Utils::sendBuryPoint(record));
+    EXPECT_NE(todaysLog().find("[sendBuryPoint] bury point error message: unknown event \n"), std::string::npos);
+    stub.setAnswer("/buryPoint", {200, R"({"code":0})"});
+    EXPECT_FALSE(Utils::sendBuryPoint(record));
+    stub.setAnswer("/buryPoint", {200, ""});
+    EXPECT_FALSE(Utils::sendBuryPoint(record));
+}
+
+TEST_F(PcsuiteRequestTest, DeviceConnectableAsksWithTheFramedEventAndReadsTheBusyState) {
+    std::string respondType = "before";
+    std::string status = "before";
+    stub.setAnswer("/isConnectBusy", {200, R"({"code":"000000","data":{"isConnectBusy":false}})"});
+    EXPECT_TRUE(Utils::isDeviceConnectable("phone", respondType, status));
+    EXPECT_EQ(status, "unconnect");
+    EXPECT_EQ(respondType, "");
+    auto requests = stub.requestsTo("/isConnectBusy");
+    ASSERT_EQ(requests.size(), 1u);
+    EXPECT_EQ(requests[0].method, "POST");
+    EXPECT_EQ(requests[0].target, "/isConnectBusy?deviceType=phone");
+    EXPECT_EQ(unframed(requests[0].body), Json::parse(R"({"event":"DeviceConnectable","deviceType":["phone"]})"));
+    EXPECT_EQ(requests[0].body.find("{\"event\""), 3u);  // "event" first, as the PC suite reads it
+
+    stub.setAnswer("/isConnectBusy",
+                   {200, R"({"code":"000000","data":{"isConnectBusy":true,"connectStatus":"connected","deviceType":"pad"}})"});
+    EXPECT_FALSE(Utils::isDeviceConnectable("pad", respondType, status));
+    EXPECT_EQ(status, "connected");
+    EXPECT_EQ(respondType, "pad");
+    EXPECT_NE(todaysLog().find("[isDeviceConnectable] current pc is connect busy! \n"), std::string::npos);
+
+    stub.setAnswer("/isConnectBusy", {200, R"({"code":"000002","data":"no license"})"});
+    EXPECT_FALSE(Utils::isDeviceConnectable("phone", respondType, status));
+    EXPECT_NE(todaysLog().find("[isDeviceConnectable] pc have reject to connect as no license \n"), std::string::npos);
+
+    // An empty answer does not hold the connection back.
+    stub.setAnswer("/isConnectBusy", {200, ""});
+    EXPECT_TRUE(Utils::isDeviceConnectable("phone", respondType, status));
+
+    // A device type is a query value, never part of the request line.
+    EXPECT_TRUE(Utils::isDeviceConnectable("a b&c", respondType, status));
+    EXPECT_EQ(stub.requestsTo("/isConnectBusy").back().param("deviceType"), "a b&c");
+}
+
+TEST_F(PcsuiteRequestTest, ConnectToPhoneAlreadyReadsTheNumberAfterTheHash) {
+    int code = -5;
+    stub.setAnswer("/", {200, "1#2", "text/plain"});
+    EXPECT_TRUE(Utils::isConnectToPhoneAlready(code));
+    EXPECT_EQ(code, 2);
+    const auto requests = stub.requestsTo("/");
+    ASSERT_EQ(requests.size(), 1u);
+    EXPECT_EQ(requests[0].method, "POST");
+    EXPECT_EQ(requests[0].body, R"(40#{"event":"checkCurrentPhone","args":[0]})");
+
+    for (const std::string body : {"12", "", "1#", "3#abc", "15#{\"code\":1}", "1#99999999999999999999"}) {
+        code = -5;
+        stub.setAnswer("/", {200, body, "text/plain"});
+        EXPECT_FALSE(Utils::isConnectToPhoneAlready(code)) << body;
+        EXPECT_EQ(code, -5) << body;
+    }
+}
+
+TEST_F(PcsuiteRequestTest, HttpMsgSendUsesTheGivenMethodUrlAndBody) {
+    std::string response = "unchanged";
+    const std::string list = R"({"deviceList":[{"deviceId":"d1"}]})";
+    EXPECT_TRUE(Utils::httpMsgSend(list, Utils::pcsuiteHttpServerSSDPQuerryAllUrl(), "POST", response));
+    EXPECT_TRUE(Utils::httpMsgSend("{}", Utils::pcsuiteHttpServerNotifySystemEventUrl(), "PUT", response));
+    EXPECT_EQ(response, "unchanged");
+    const auto requests = stub.requests();
+    ASSERT_EQ(requests.size(), 2u);
+    EXPECT_EQ(requests[0].method, "POST");
+    EXPECT_EQ(requests[0].path, "/SSDPQueryAll");
+    EXPECT_EQ(requests[0].body, list);
+    EXPECT_EQ(requests[1].method, "PUT");
+    EXPECT_EQ(requests[1].path, "/notifySystemEvent");
+    EXPECT_NE(todaysLog().find("[Utils::httpMsgSend] Send http request url: " +
+                               Utils::pcsuiteHttpServerSSDPQuerryAllUrl() + ", body: " + list),
+              std::string::npos);
+}
+
+TEST_F(PcsuiteRequestTest, HttpAliveSendsTheHeartBeatToTheControlServer) {
+    test::StubPcSuite control;
+    control.pointControlHere(env.config());
+    control.setAnswer("/", {200, R"(34#{"code":0,"msg":"","data":"Alive"})", "text/plain"});
+    EXPECT_TRUE(Utils::isHttpAlive());
+    ASSERT_EQ(control.requestCount(), 1u);
+    EXPECT_EQ(control.requests()[0].method, "POST");
+    EXPECT_EQ(control.requests()[0].body, R"(32#{"event":"HeartBeat","args":[0]})");
+    EXPECT_EQ(stub.requestCount(), 0u);  // nothing went to the PC suite
+    control.stop();
+    EXPECT_FALSE(Utils::isHttpAlive());
+
+    // The service's real control server answers it.
+    env.config().controlPort = 0;
+    HttpService service;
+    ASSERT_TRUE(service.startHttpServic());
+    env.config().controlPort = service.port();
+    EXPECT_TRUE(Utils::isHttpAlive());
+    service.stop();
+}
+
+// A PC suite that is not running, or hangs without answering: nothing waits longer than
+// the request's limit, connections are allowed, everything else fails.
+TEST_F(PcsuiteRequestTest, PcSuiteDownOrHungGivesTheFailureAnswers) {
+    auto checkAll = [](const char* what) {
+        std::string respondType = "t";
+        std::string status = "s";
+        int code = -5;
+        std::string response;
+        EXPECT_TRUE(Utils::isDeviceConnectable("phone", respondType, status)) << what;
+        EXPECT_EQ(respondType, "t") << what;
+        EXPECT_EQ(status, "s") << what;
+        EXPECT_FALSE(Utils::sendBuryPoint("[{}]")) << what;
+        EXPECT_FALSE(Utils::isConnectToPhoneAlready(code)) << what;
+        EXPECT_EQ(code, -5) << what;
+        EXPECT_FALSE(Utils::httpMsgSend("{}", Utils::pcsuiteHttpServerSSDPQuerryAllUrl(), "POST", response)) << what;
+        EXPECT_FALSE(PcsuiteRequest::getPcDeviceInfo().has_value()) << what;
+        EXPECT_FALSE(PcsuiteRequest::startConnectPreDevice({{"deviceId", "d"}}).has_value()) << what;
+        EXPECT_FALSE(RequestBase::urlSessionPost("{}", Utils::pcsuiteHttpServerUrl())) << what;
+    };
+
+    // Hung: every answer would come (as a success) only after the limits.
+    env.config().httpRequestTimeout = 150ms;
+    env.config().httpWaitTimeout = 150ms;
+    stub.setDefaultAnswer({200, R"({"code":"000000","data":{"isConnectBusy":true}})", "application/json", 60s});
+    stub.setAnswer("/", {200, "1#1", "text/plain", 60s});
+    checkAll("hung");
+    EXPECT_TRUE(stub.waitForRequests(7, 10s));  // they all reached the PC suite
+
+    // Down.
+    stub.stop();
+    checkAll("down");
+    EXPECT_NE(todaysLog().find("[isDeviceConnectable] http client respond data is empty! \n"), std::string::npos);
+    EXPECT_NE(todaysLog().find("[sendBuryPoint] http client respond data is empty! \n"), std::string::npos);
+    EXPECT_NE(todaysLog().find("[isConnectToPhoneAlready] http client respond data is empty! \n"), std::string::npos);
+    EXPECT_NE(todaysLog().find("[Utils::httpMsgSend] httpMsgSend but no response return\n"), std::string::npos);
+}
+
+}  // namespace
+}  // namespace kesu

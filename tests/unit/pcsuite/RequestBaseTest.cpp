@@ -1,0 +1,217 @@
+// The outbound HTTP client against a real stub server: headers, the answer table, the 429
+// retries, time-outs, a server that is not there, and https certificate checks.
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+
+#include "core/Utils.h"
+#include "pcsuite/RequestBase.h"
+#include "support/StubPcSuite.h"
+#include "support/TestSupport.h"
+
+namespace kesu {
+namespace {
+
+using namespace std::chrono_literals;
+using test::CannedAnswer;
+
+std::string todaysLog() { return test::readAll(Utils::logFilePath(Utils::now())); }
+
+std::size_t occurrences(const std::string& text, const std::string& part) {
+    std::size_t n = 0;
+    for (auto pos = text.find(part); pos != std::string::npos; pos = text.find(part, pos + part.size())) ++n;
+    return n;
+}
+
+class RequestBaseTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        env.config().httpRequestTimeout = 2s;
+        env.config().httpWaitTimeout = 2s;
+        env.config().http429Pause = 50ms;
+    }
+    void TearDown() override { Utils::closeLog(); }
+    test::HermeticEnv env;
+    test::StubPcSuite stub;
+};
+
+TEST_F(RequestBaseTest, SendsMergedHeadersAndReadsCodeAndMsgOfTheAnswer) {
+    stub.setAnswer("/device/list", {200, R"({"code":7,"msg":"fine","data":[1,2]})"});
+    int status = -1;
+    std::string msg = "caller";
+    Json answer = RequestBase::post(stub.baseUrl(), "device/list", std::string(R"({"a":1})"),
+                                    {{"token", "abcdefghijklmnop"}, {"X-Extra", "1"}}, status, msg);
+    EXPECT_EQ(answer, Json::parse(R"({"code":7,"msg":"fine","data":[1,2]})"));
+    EXPECT_EQ(status, 7);
+    EXPECT_EQ(msg, "fine");
+    auto requests = stub.requests();
+    ASSERT_EQ(requests.size(), 1u);
+    EXPECT_EQ(requests[0].method, "POST");
+    EXPECT_EQ(requests[0].path, "/device/list");
+    EXPECT_EQ(requests[0].body, R"({"a":1})");
+    EXPECT_EQ(requests[0].header("Content-Type"), "application/json");
+    EXPECT_EQ(requests[0].header("token"), "abcdefghijklmnop");
+    EXPECT_EQ(requests[0].header("X-Extra"), "1");
+
+    // A caller's Content-Type replaces the default (whatever its spelling); a GET keeps its
+    // query; an answer without "code"/"msg" gives 0 and "".
+    stub.setAnswer("/device/info", {200, R"({"data":{"x":1}})"});
+    status = -1;
+    msg = "caller";
+    answer = RequestBase::get(stub.baseUrl(), "device/info?deviceId=ab12", std::nullopt,
+                              {{"content-type", "application/x-www-form-urlencoded"}}, status, msg);
+    EXPECT_EQ(json::object(answer, "data"), Json::parse(R"({"x":1})"));
+    EXPECT_EQ(status, 0);
+    EXPECT_EQ(msg, "");
+    requests = stub.requestsTo("/device/info");
+    ASSERT_EQ(requests.size(), 1u);
+    EXPECT_EQ(requests[0].method, "GET");
+    EXPECT_EQ(requests[0].param("deviceId"), "ab12");
+    EXPECT_EQ(requests[0].headers.count("Content-Type"), 1u);
+    EXPECT_EQ(requests[0].header("Content-Type"), "application/x-www-form-urlencoded");
+}
+
+TEST_F(RequestBaseTest, RetriesThreeTimesOn429AndReturnsTheLastAnswer) {
+    for (int i = 1; i <= 3; ++i) stub.queueAnswer("/busy", {429, R"({"code":429,"try":)" + std::to_string(i) + "}"});
+    stub.setAnswer("/busy", {200, R"({"code":"000000"})"});
+    int status = 0;
+    std::string msg;
+    const Json answer = RequestBase::post(stub.baseUrl(), "busy", std::nullopt, {}, status, msg);
+    EXPECT_EQ(json::integer(answer, "try"), 3);
+    EXPECT_EQ(status, 429);
+    const auto requests = stub.requests();
+    ASSERT_EQ(requests.size(), 3u);  // no fourth attempt
+    // The pauses lie between the attempts.
+    EXPECT_GE(requests[1].receivedAt - requests[0].receivedAt, env.config().http429Pause);
+    EXPECT_GE(requests[2].receivedAt - requests[1].receivedAt, env.config().http429Pause);
+    const std::string log = todaysLog();
+    const std::string line = "[RequestBase][http] http request status code is 429, request again, request num: ";
+    EXPECT_EQ(occurrences(log, line), 3u);
+    for (int i = 1; i <= 3; ++i) EXPECT_NE(log.find(line + std::to_string(i)), std::string::npos) << i;
+
+    // One 429, then a normal answer: two requests, the normal answer comes back.
+    stub.clearRequests();
+    stub.queueAnswer("/busy", {429, "{}"});
+    const Json second = RequestBase::post(stub.baseUrl(), "busy", std::nullopt, {}, status, msg);
+    EXPECT_EQ(json::str(second, "code"), "000000");
+    EXPECT_EQ(stub.requestCount(), 2u);
+}
+
+TEST_F(RequestBaseTest, EmptyOrNonJsonAnswersGiveTimeoutWithTheHttpStatus) {
+    const Json timeout{{"error", "timeout"}};
+    struct Case {
+        CannedAnswer answer;
+        std::string expectedMsg;
+    };
+    const std::vector<Case> cases{
+        {{200, ""}, "caller"},                 // nothing to read: the caller's msg stays
+        {{202, "not json", "text/plain"}, "not json"},
+        {{200, "{}"}, "{}"},                   // an empty object is no answer either
+        {{500, "\xff\xfe{", "text/plain"}, "caller"},  // not UTF-8: read as empty
+    };
+    for (const auto& c : cases) {
+        stub.setAnswer("/x", c.answer);
+        int status = -1;
+        std::string msg = "caller";
+        EXPECT_EQ(RequestBase::post(stub.baseUrl(), "x", std::nullopt, {}, status, msg), timeout) << c.answer.body;
+        EXPECT_EQ(status, c.answer.status) << c.answer.body;
+        EXPECT_EQ(msg, c.expectedMsg) << c.answer.body;
+    }
+}
+
+TEST_F(RequestBaseTest, NoResponseKeepsTheCallersStatusAndMsg) {
+    const Json timeout{{"error", "timeout"}};
+    int status = 77;
+    std::string msg = "keep";
+    // Nobody listens.
+    const std::string closed = "http://127.0.0.1:" + std::to_string(test::freeTcpPort()) + "/";
+    EXPECT_EQ(RequestBase::post(closed, "pcDeviceInfo", std::nullopt, {}, status, msg), timeout);
+    EXPECT_EQ(status, 77);
+    EXPECT_EQ(msg, "keep");
+    EXPECT_NE(todaysLog().find("[RequestBase][http] Invalid response, path: pcDeviceInfo"), std::string::npos);
+    EXPECT_NE(todaysLog().find("[RequestBase][http] " + closed + "pcDeviceInfo timeout 20s"), std::string::npos);
+
+    // A server that answers later than the request's limit: the caller gets the time-out
+    // instead of the (successful) late answer.
+    env.config().httpRequestTimeout = 200ms;
+    stub.setAnswer("/slow", {200, R"({"code":1})", "application/json", 30s});
+    EXPECT_EQ(RequestBase::post(stub.baseUrl(), "slow", std::nullopt, {}, status, msg), timeout);
+    EXPECT_EQ(status, 77);
+    EXPECT_EQ(msg, "keep");
+
+    // An answer above the size limit is dropped, not kept in memory.
+    env.config().httpRequestTimeout = 2s;
+    env.config().httpMaxAnswerBody = 1024;
+    stub.setAnswer("/big", {200, R"({"code":1,"pad":")" + std::string(4096, 'x') + "\"}"});
+    EXPECT_EQ(RequestBase::post(stub.baseUrl(), "big", std::nullopt, {}, status, msg), timeout);
+    EXPECT_EQ(status, 77);
+
+    // A malformed URL is refused before anything is sent.
+    EXPECT_EQ(RequestBase::post("127.0.0.1:9/", "x", std::nullopt, {}, status, msg), timeout);
+}
+
+TEST_F(RequestBaseTest, UrlSessionPostReportsWhetherAnAnswerCame) {
+    stub.setAnswer("/", {200, ""});
+    EXPECT_TRUE(RequestBase::urlSessionPost(R"({"phone":"p1"})", stub.baseUrl()));
+    const auto requests = stub.requests();
+    ASSERT_EQ(requests.size(), 1u);
+    EXPECT_EQ(requests[0].method, "POST");
+    EXPECT_EQ(requests[0].body, R"({"phone":"p1"})");
+    EXPECT_NE(todaysLog().find("[Notify Pcsuite] Notify Server to accept mirroscreen data success"), std::string::npos);
+
+    const std::string closed = "http://127.0.0.1:" + std::to_string(test::freeTcpPort()) + "/";
+    EXPECT_FALSE(RequestBase::urlSessionPost("x", closed));
+    EXPECT_NE(todaysLog().find("[Notify Pcsuite] Notify Server to accept mirroscreen data but no response return"),
+              std::string::npos);
+}
+
+TEST(RequestBaseMask, CredentialsAreMaskedForTheLog) {
+    const std::string masked = RequestBase::maskForLog(R"({"userId":"u1","token":"abcdefghijklmnop","n":{"accessToken":"qrstuvwxyz123"}})");
+    EXPECT_EQ(masked.find("abcdefghijklmnop"), std::string::npos);
+    EXPECT_EQ(masked.find("qrstuvwxyz123"), std::string::npos);
+    EXPECT_NE(masked.find("abc****nop"), std::string::npos);
+    EXPECT_NE(masked.find("\"u1\""), std::string::npos);
+    // Framed texts too; texts without credentials stay byte for byte.
+    EXPECT_EQ(RequestBase::maskForLog(R"(40#{"event":"x","token":"abcdefghijklmnop"})").find("abcdefghijklmnop"),
+              std::string::npos);
+    EXPECT_EQ(RequestBase::maskForLog(R"({ "b":1, "a":2 })"), R"({ "b":1, "a":2 })");
+    const std::string headers = RequestBase::headersForLog({{"token", "abcdefghijklmnop"}, {"userId", "u1"}});
+    EXPECT_EQ(headers.find("abcdefghijklmnop"), std::string::npos);
+    EXPECT_NE(headers.find("userId: u1"), std::string::npos);
+}
+
+// https against a server whose certificate comes from a CA made for the test.
+TEST(RequestBaseHttps, VerifiesTheServerCertificate) {
+    test::HermeticEnv env;
+    env.config().httpRequestTimeout = 5s;
+    const std::string dir = env.dir().str();
+    const std::string cert = dir + "/cert.pem";
+    const std::string key = dir + "/key.pem";
+    const std::string command = "openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -keyout '" +
+                                key + "' -out '" + cert +
+                                "' -days 2 -subj /CN=127.0.0.1 -addext subjectAltName=IP:127.0.0.1 >/dev/null 2>&1";
+    if (std::system(command.c_str()) != 0) GTEST_SKIP() << "openssl could not make a test certificate";
+
+    test::StubPcSuite secure(cert, key);
+    secure.setAnswer("/event/create", {200, R"({"code":0,"msg":"ok"})"});
+    const Json timeout{{"error", "timeout"}};
+
+    // Not trusted: the request never reaches the server.
+    int status = -1;
+    std::string msg;
+    EXPECT_EQ(RequestBase::post(secure.baseUrl(), "event/create", std::string("{}"), {}, status, msg), timeout);
+    EXPECT_EQ(secure.requestCount(), 0u);
+
+    // Trusted through the configured CA file.
+    env.config().caCertPath = cert;
+    EXPECT_EQ(RequestBase::post(secure.baseUrl(), "event/create", std::string("{}"), {}, status, msg),
+              Json::parse(R"({"code":0,"msg":"ok"})"));
+    EXPECT_EQ(status, 0);
+    EXPECT_EQ(msg, "ok");
+    ASSERT_EQ(secure.requestCount(), 1u);
+    EXPECT_EQ(secure.requests()[0].body, "{}");
+    Utils::closeLog();
+}
+
+}  // namespace
+}  // namespace kesu
