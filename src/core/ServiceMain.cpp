@@ -5,6 +5,8 @@
 #include <cstring>
 #include <string>
 
+#include "account/DataGet.h"
+#include "account/FileMonitor.h"
 #include "control/HttpService.h"
 #include "core/HttpAliveCheck.h"
 #include "core/ServiceManager.h"
@@ -34,6 +36,8 @@ int runService() {
     Utils::deleteOldLogFile();
     Utils::GetPcSystemInfo();
     HttpService::httpService().startHttpServic();
+    fileMonitorStart();
+    updateHistoryDevice();
 
     ServiceManager manager;
     manager.start();
@@ -45,6 +49,7 @@ int runService() {
     Utils::mPrintlog("[服务启动] signal " + std::string(strsignal(signalNumber)) + " received, stopping");
     watchdog.stop();
     manager.stop();
+    fileMonitorStop();
     HttpService::httpService().stop();
     Utils::mPrintlog("[服务启动] stopped");
     Utils::closeLog();

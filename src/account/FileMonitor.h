@@ -1,0 +1,77 @@
+// Watches the PC suite's account database Config.db by its modification time and, when it
+// changes (and once at start), re-reads the account, asks the local push client for its
+// client id and publishes "AccountChangeEvent".
+#pragma once
+
+#include <chrono>
+#include <condition_variable>
+#include <mutex>
+#include <string>
+#include <thread>
+
+namespace kesu {
+
+class FileMonitor {
+public:
+    using TimePoint = std::chrono::system_clock::time_point;
+
+    // `databaseFilePath` is the folder of Config.db. The poll period and the push client's
+    // port are taken from Config now.
+    explicit FileMonitor(std::string databaseFilePath);
+    ~FileMonitor();
+    FileMonitor(const FileMonitor&) = delete;
+    FileMonitor& operator=(const FileMonitor&) = delete;
+
+    // Starts the polling thread; its first pass runs at once. False when already running.
+    bool start();
+    // Ends the loop at once and joins its thread; harmless when it does not run.
+    void stop();
+    bool running() const;
+
+    // One pass of the loop. Runs on the polling thread; tests call it directly instead of
+    // starting the thread (never both).
+    void runPass();
+
+    const std::string& databaseFilePath() const { return databaseFilePath_; }
+
+    // True when something (file or folder) exists at the path; logs the loss otherwise.
+    static bool fileExist(const std::string& filePath);
+    // Whether Config.db in `directory` must be read now: its modification time differs from
+    // `lastFileChange`, or this is the first read. A file that cannot be examined (removed
+    // since the existence check) counts as no change.
+    static bool fileAttributeGet(const std::string& directory, TimePoint& lastFileChange, bool& isFirstRead,
+                                 int& readFileTimes);
+    // "yyyy-MM-dd HH:mm:ss Z" (Z like +0000) to local "yyyy:MM:dd HH:mm:ss"; "" when it
+    // does not parse. Used in log lines only.
+    static std::string getLocalDate(const std::string& from);
+    // The UTC description of a time, the form getLocalDate reads.
+    static std::string dateDescription(TimePoint time);
+
+private:
+    void loop();
+    void readAndAnnounce();
+
+    const std::string databaseFilePath_;
+    const std::chrono::milliseconds period_;
+    const int pushClientPort_;
+
+    // State of the passes; touched only by the thread that runs them.
+    TimePoint lastModifyTime;
+    bool firstRead = true;
+    int databaseReadTimes = 0;
+    bool fileLost_ = false;
+
+    std::mutex lifecycle_;  // start() and stop() one at a time
+    mutable std::mutex mutex_;
+    std::condition_variable wake_;
+    bool stopping_ = false;
+    std::thread thread_;
+};
+
+// Starts the process-wide monitor on the PC suite's database folder, then fills the PC's
+// device id and version. False when a monitor already runs.
+bool fileMonitorStart();
+// Stops the process-wide monitor (orderly stop, tests).
+void fileMonitorStop();
+
+}  // namespace kesu

@@ -1,0 +1,309 @@
+// Reading the account from real Config.db files, the history file and the library paths.
+#include "account/DataGet.h"
+
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <httplib.h>
+
+#include <atomic>
+#include <fstream>
+#include <mutex>
+#include <thread>
+
+#include "unit/account/AccountFixture.h"
+
+namespace kesu::test {
+namespace {
+
+using DataGetTest = AccountFixture;
+
+// Fills the first page of `table` with garbage, leaving the schema page intact.
+void overwriteTablePage(const std::string& path, const std::string& table) {
+    sqlite3* db = nullptr;
+    ASSERT_EQ(sqlite3_open(path.c_str(), &db), SQLITE_OK);
+    sqlite3_stmt* stmt = nullptr;
+    sqlite3_prepare_v2(db, "SELECT rootpage FROM sqlite_master WHERE name = ?; ", -1, &stmt, nullptr);
+    sqlite3_bind_text(stmt, 1, table.c_str(), -1, SQLITE_TRANSIENT);
+    ASSERT_EQ(sqlite3_step(stmt), SQLITE_ROW);
+    const int page = sqlite3_column_int(stmt, 0);
+    sqlite3_finalize(stmt);
+    sqlite3_prepare_v2(db, "PRAGMA page_size;", -1, &stmt, nullptr);
+    ASSERT_EQ(sqlite3_step(stmt), SQLITE_ROW);
+    const int pageSize = sqlite3_column_int(stmt, 0);
+    sqlite3_finalize(stmt);
+    sqlite3_close(db);
+    ASSERT_GT(page, 1);
+    std::fstream file(path, std::ios::in | std::ios::out | std::ios::binary);
+    file.seekp(static_cast<std::streamoff>(page - 1) * pageSize);
+    const std::string garbage(static_cast<std::size_t>(pageSize), '\xA5');
+    file.write(garbage.data(), static_cast<std::streamsize>(garbage.size()));
+}
+
+const std::string kSignedIn =
+    "INSERT INTO User VALUES ('oid-1', '13812345678', 'tok-SECRET-1');"
+    "INSERT INTO SoftwareSet VALUES ('oid-other', '/cfg/other', '/store/other');"
+    "INSERT INTO SoftwareSet VALUES ('oid-1', '/cfg/one', '/store/one');";
+
+TEST_F(DataGetTest, PathsFollowTheHomeFolder) {
+    std::string base;
+    EXPECT_FALSE(getSanboxPth(base));
+    EXPECT_EQ(base, env.home() + "/Library/");
+    EXPECT_EQ(base, Utils::libraryBase());
+    std::string dir;
+    FilePathget(dir);
+    EXPECT_EQ(dir, dbDir());
+    EXPECT_EQ(historyPhoneFilePath(), supportDir() + "/historyPhone.json");
+    EXPECT_EQ(pcsuiteConfigFilePath(), supportDir() + "/config.json");
+    EXPECT_NE(logText().find("[Sandbox]Service is in sandbox? false"), std::string::npos);
+
+    // No sandbox on Linux: a home that merely contains "Containers" is an ordinary home.
+    ScopedEnv home("HOME", "/srv/Containers/app/Data");
+    EXPECT_FALSE(getSanboxPth(base));
+    EXPECT_EQ(base, "/srv/Containers/app/Data/Library/");
+    EXPECT_EQ(containerLibraryBase("/Users/name/Library/Containers/app/Data"), "/Users/name/Library/");
+    EXPECT_EQ(containerLibraryBase("/Containers"), std::nullopt);
+}
+
+TEST_F(DataGetTest, SignedInAccountIsReadWithoutLoggingTheToken) {
+    writeDatabase(dbFile(), kSignedIn);
+    dataBaseRead(dbDir());
+    const databaseParam p = dataInstance().get();
+    EXPECT_EQ(p.openid, "oid-1");
+    EXPECT_EQ(p.Phone, "138****678");
+    EXPECT_EQ(p.token, "tok-SECRET-1");
+    EXPECT_EQ(p.lastOpenId, "oid-1");
+    EXPECT_EQ(p.lastToken, "tok-SECRET-1");
+    EXPECT_EQ(p.configDir, "/cfg/one");  // the row of this account, not the last row
+    EXPECT_EQ(p.storageDir, "/store/one");
+    EXPECT_TRUE(retGet());
+
+    const std::string log = logText();
+    EXPECT_NE(log.find("[dataBaseRead]  DataBase file Config.db open success"), std::string::npos);
+    EXPECT_NE(log.find("[notifySSDP] notifySSDP- Currently data param is openid: oid-1 \r phone: 138****678 \r "
+                       "ConfigDir: /cfg/one \r StorageDir: /store/one"),
+              std::string::npos);
+    EXPECT_EQ(log.find("tok-SECRET-1"), std::string::npos);
+    EXPECT_EQ(log.find("13812345678"), std::string::npos);
+}
+
+TEST_F(DataGetTest, RowsLastWinsNullPhoneKeepsPhoneNullTextReadsEmpty) {
+    writeDatabase(dbFile(),
+                  "INSERT INTO User VALUES ('oid-a', '13800000001', 'tok-a');"
+                  "INSERT INTO User VALUES ('oid-b', '123456', 'tok-b');");
+    dataBaseRead(dbDir());
+    databaseParam p = dataInstance().get();
+    EXPECT_EQ(p.openid, "oid-b");
+    EXPECT_EQ(p.Phone, "123456");  // fewer than 7 characters: unmasked
+    EXPECT_EQ(p.token, "tok-b");
+    EXPECT_EQ(p.lastToken, "tok-b");
+
+    // A NULL phone leaves the phone alone; a NULL token or open id is read as "".
+    writeDatabase(dbFile(), "INSERT INTO User VALUES ('oid-c', NULL, NULL);");
+    dataBaseRead(dbDir());
+    p = dataInstance().get();
+    EXPECT_EQ(p.openid, "oid-c");
+    EXPECT_EQ(p.Phone, "123456");
+    EXPECT_EQ(p.token, "");
+    EXPECT_EQ(p.lastOpenId, "oid-c");
+
+    writeDatabase(dbFile(), "INSERT INTO User VALUES (NULL, '13800000002', 'tok-d');"
+                            "INSERT INTO SoftwareSet VALUES (NULL, NULL, NULL);");
+    dataBaseRead(dbDir());
+    p = dataInstance().get();
+    EXPECT_EQ(p.openid, "");
+    EXPECT_EQ(p.Phone, "138****002");
+}
+
+TEST_F(DataGetTest, EmptyUserTableSignsOutButKeepsDirectoriesAndLastValues) {
+    writeDatabase(dbFile(), kSignedIn);
+    dataBaseRead(dbDir());
+    writeDatabase(dbFile(), "INSERT INTO SoftwareSet VALUES ('oid-1', '/cfg/new', '/store/new');");
+    dataBaseRead(dbDir());
+    const databaseParam p = dataInstance().get();
+    EXPECT_EQ(p.openid, "");
+    EXPECT_EQ(p.Phone, "");
+    EXPECT_EQ(p.token, "");
+    EXPECT_EQ(p.lastOpenId, "oid-1");
+    EXPECT_EQ(p.lastToken, "tok-SECRET-1");
+    EXPECT_EQ(p.configDir, "/cfg/one");
+    EXPECT_EQ(p.storageDir, "/store/one");
+}
+
+TEST_F(DataGetTest, UnreadableDatabaseKeepsThePreviousAccount) {
+    env.config().databaseBusyTimeout = std::chrono::milliseconds(0);
+    writeDatabase(dbFile(), kSignedIn);
+    dataBaseRead(dbDir());
+    const databaseParam before = dataInstance().get();
+    ASSERT_EQ(before.openid, "oid-1");
+
+    // Missing file: the read fails and, being read-only, creates nothing.
+    const std::string otherDir = env.dir().str() + "/nodb";
+    std::filesystem::create_directories(otherDir);
+    dataBaseRead(otherDir);
+    EXPECT_FALSE(std::filesystem::exists(otherDir + "/Config.db"));
+    EXPECT_NE(logText().find("[dataBaseRead] Database file Config.db open failed due to : 14 current time is: "),
+              std::string::npos);
+    EXPECT_EQ(dataInstance().get().openid, "oid-1");
+
+    // A file that is not a database.
+    env.dir().write("junk/Config.db", "this is not an SQLite file, just some text that is long enough");
+    dataBaseRead(env.dir().str() + "/junk");
+    EXPECT_NE(logText().find("[readDatabase] read database Table User failed"), std::string::npos);
+    EXPECT_EQ(dataInstance().get().token, "tok-SECRET-1");
+
+    // The PC suite holds an exclusive lock while writing: not a sign-out.
+    sqlite3* writer = nullptr;
+    ASSERT_EQ(sqlite3_open(dbFile().c_str(), &writer), SQLITE_OK);
+    ASSERT_EQ(sqlite3_exec(writer, "BEGIN EXCLUSIVE; DELETE FROM User;", nullptr, nullptr, nullptr), SQLITE_OK);
+    dataBaseRead(dbDir());
+    const databaseParam during = dataInstance().get();
+    sqlite3_exec(writer, "ROLLBACK;", nullptr, nullptr, nullptr);
+    sqlite3_close(writer);
+    EXPECT_EQ(during.openid, before.openid);
+    EXPECT_EQ(during.token, before.token);
+    EXPECT_EQ(during.Phone, before.Phone);
+
+    // A damaged table page (the schema itself is sound): the rows cannot be read, which is
+    // not the same as no rows.
+    const std::string damagedDir = env.dir().str() + "/damaged";
+    std::filesystem::create_directories(damagedDir);
+    writeDatabase(damagedDir + "/Config.db", "INSERT INTO User VALUES ('oid-x', '13800000009', 'tok-x');");
+    overwriteTablePage(damagedDir + "/Config.db", "User");
+    dataBaseRead(damagedDir);
+    EXPECT_EQ(dataInstance().get().openid, "oid-1");
+    EXPECT_EQ(dataInstance().get().token, "tok-SECRET-1");
+
+    // Without the SoftwareSet table the account is read, the directories are not.
+    sqlite3* db = nullptr;
+    ASSERT_EQ(sqlite3_open(dbFile().c_str(), &db), SQLITE_OK);
+    sqlite3_exec(db, "DROP TABLE SoftwareSet; UPDATE User SET token = 'tok-2';", nullptr, nullptr, nullptr);
+    sqlite3_close(db);
+    dataBaseRead(dbDir());
+    EXPECT_EQ(dataInstance().get().token, "tok-2");
+    EXPECT_EQ(dataInstance().get().configDir, "/cfg/one");
+    EXPECT_FALSE(retGet());
+    EXPECT_NE(logText().find("[readDatabase] read database Table SoftwareSet failed"), std::string::npos);
+    EXPECT_FALSE(queryTables(nullptr, "Other", false, ""));
+}
+
+TEST_F(DataGetTest, OpenIdWithQuotesIsMatchedLiterally) {
+    writeDatabase(dbFile(),
+                  "INSERT INTO User VALUES ('o''brien\"x', '13812345678', 't');"
+                  "INSERT INTO SoftwareSet VALUES ('o''brien\"x', '/cfg/ob', '/store/ob');");
+    dataBaseRead(dbDir());
+    EXPECT_EQ(dataInstance().get().openid, "o'brien\"x");
+    EXPECT_EQ(dataInstance().get().configDir, "/cfg/ob");
+    EXPECT_TRUE(retGet());
+
+    // An open id shaped like SQL selects nothing: the other account's row must not leak in.
+    writeDatabase(dbFile(),
+                  "INSERT INTO User VALUES ('x'' OR ''1''=''1', '13812345678', 't');"
+                  "INSERT INTO SoftwareSet VALUES ('someone-else', '/cfg/else', '/store/else');");
+    dataBaseRead(dbDir());
+    EXPECT_EQ(dataInstance().get().openid, "x' OR '1'='1");
+    EXPECT_EQ(dataInstance().get().configDir, "/cfg/ob");
+    EXPECT_EQ(dataInstance().get().storageDir, "/store/ob");
+}
+
+TEST_F(DataGetTest, ReadersNeverSeeAnOpenIdWithAnotherAccountsToken) {
+    env.config().databaseBusyTimeout = std::chrono::milliseconds(0);
+    const std::string dirA = env.dir().str() + "/a", dirB = env.dir().str() + "/b";
+    std::filesystem::create_directories(dirA);
+    std::filesystem::create_directories(dirB);
+    writeDatabase(dirA + "/Config.db", "INSERT INTO User VALUES ('aaaa', '11111111111', 'token-aaaa');");
+    writeDatabase(dirB + "/Config.db", "INSERT INTO User VALUES ('bbbb', '22222222222', 'token-bbbb');");
+
+    std::atomic<bool> done{false};
+    std::atomic<int> mismatches{0};
+    std::thread reader([&] {
+        while (!done.load()) {
+            const databaseParam p = dataInstance().get();
+            if (!p.openid.empty() && p.token != "token-" + p.openid) ++mismatches;
+        }
+    });
+    for (int i = 0; i < 100; ++i) dataBaseRead(i % 2 ? dirB : dirA);
+    done = true;
+    reader.join();
+    EXPECT_EQ(mismatches.load(), 0);
+}
+
+TEST_F(DataGetTest, HistoryFileFillsTheLastDevices) {
+    dataInstance().update([](databaseParam& p) {
+        p.historyPhoneId = "old-phone";
+        p.historyPadId = "old-pad";
+    });
+    updateHistoryDevice();  // missing file
+    EXPECT_EQ(dataInstance().get().historyPhoneId, "old-phone");
+    EXPECT_NE(logText().find("[updateHistoryDevice] Read file path is: " + supportDir() + "/historyPhone.json"),
+              std::string::npos);
+
+    env.dir().write("home/Library/Application Support/pcsuite/historyPhone.json", "{\"last_time_phone\": {\"bl");
+    updateHistoryDevice();  // half-written
+    EXPECT_EQ(dataInstance().get().historyPadId, "old-pad");
+
+    env.dir().write("home/Library/Application Support/pcsuite/historyPhone.json",
+                    R"({"last_time_phone": {"bleId": "AA:BB"}, "last_time_pad": {"bleId": 7}})");
+    updateHistoryDevice();
+    EXPECT_EQ(dataInstance().get().historyPhoneId, "AA:BB");
+    EXPECT_EQ(dataInstance().get().historyPadId, "");
+    EXPECT_NE(logText().find("[updateHistoryDevice] historyPhoneId: AA:BB, historyPadId:  "), std::string::npos);
+}
+
+// The PC suite's local server, answering the device-information request with a set text.
+class PcsuiteStub {
+public:
+    PcsuiteStub() {
+        server_.Post("/pcDeviceInfo", [this](const httplib::Request&, httplib::Response& res) {
+            std::lock_guard<std::mutex> lock(mutex_);
+            res.set_content(answer_, "application/json");
+        });
+        port_ = server_.bind_to_any_port("127.0.0.1");
+        thread_ = std::thread([this] { server_.listen_after_bind(); });
+    }
+    ~PcsuiteStub() {
+        server_.stop();
+        thread_.join();
+    }
+    int port() const { return port_; }
+    void answer(std::string text) {
+        std::lock_guard<std::mutex> lock(mutex_);
+        answer_ = std::move(text);
+    }
+
+private:
+    httplib::Server server_;
+    std::mutex mutex_;
+    std::string answer_;
+    int port_ = 0;
+    std::thread thread_;
+};
+
+TEST_F(DataGetTest, DeviceIdComesFromThePcsuiteThenFromConfigJson) {
+    PcsuiteStub stub;
+    env.config().pcsuitePort = stub.port();
+    env.config().httpRequestTimeout = std::chrono::milliseconds(5000);
+    env.dir().write("home/Library/Application Support/pcsuite/config.json", R"({"newDeviceId": "file-id"})");
+
+    stub.answer(R"({"code": "000000", "data": {"deviceId": "suite-id", "version": "9.1.0"}})");
+    EXPECT_EQ(getPcsuiteDeviceInfo(), "suite-id");
+    EXPECT_EQ(dataInstance().get().version, "9.1.0");
+    EXPECT_NE(logText().find("[getPcsuiteDeviceId] Request pcsuite id: suite-id, version: 9.1.0"), std::string::npos);
+
+    // A numeric id is no id; a missing version falls back to the service's own.
+    stub.answer(R"({"code": "000000", "data": {"deviceId": 12345}})");
+    EXPECT_EQ(getPcsuiteDeviceInfo(), "file-id");
+    EXPECT_EQ(dataInstance().get().version, Utils::versionCode);
+    EXPECT_NE(logText().find("[getPcsuiteDeviceInfo] Read file path is: " + supportDir() + "/config.json"),
+              std::string::npos);
+
+    // The PC suite refuses and config.json has no id: empty, and said so.
+    stub.answer(R"({"code": "000001"})");
+    dataInstance().set(&databaseParam::pcDeviceId, "");
+    env.dir().write("home/Library/Application Support/pcsuite/config.json", R"({"other": 1})");
+    EXPECT_EQ(getPcsuiteDeviceInfo(), "");
+    EXPECT_NE(logText().find("[getPcsuiteDeviceId] Device ID retrieval failed."), std::string::npos);
+}
+
+}  // namespace
+}  // namespace kesu::test
