@@ -14,6 +14,7 @@
 
 namespace kesu {
 
+HttpService::HttpService() = default;
 HttpService::~HttpService() { stop(); }
 
 HttpService& HttpService::httpService() {
@@ -83,7 +84,12 @@ bool HttpService::startHttpServic() {
     port_ = bound;
     httplib::Server* raw = server.get();
     serve_ = std::move(server);
-    listener_ = std::thread([raw] { raw->listen_after_bind(); });
+    auto ended = std::make_shared<std::promise<void>>();
+    listenerEnded_ = ended->get_future();
+    listener_ = std::thread([raw, ended] {
+        raw->listen_after_bind();
+        ended->set_value();
+    });
     Utils::mPrintlog("[httpService]Run succ ");
     return true;
 }
@@ -91,14 +97,20 @@ bool HttpService::startHttpServic() {
 void HttpService::stop() {
     std::unique_ptr<httplib::Server> server;
     std::thread listener;
+    std::future<void> ended;
     {
         std::lock_guard<std::mutex> lock(mutex_);
         server = std::move(serve_);
         listener = std::move(listener_);
+        ended = std::move(listenerEnded_);
         port_ = 0;
     }
     if (!server) return;
-    server->stop();
+    // The library ignores a stop that comes before its listen loop has begun: repeat it
+    // until the listener has ended.
+    do {
+        server->stop();
+    } while (ended.valid() && ended.wait_for(std::chrono::milliseconds(20)) != std::future_status::ready);
     if (listener.joinable()) listener.join();
 }
 

@@ -2,6 +2,7 @@
 // decodes the length-prefixed envelope, dispatches it and answers "N#json" or an empty body.
 #pragma once
 
+#include <future>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -15,7 +16,7 @@ namespace kesu {
 
 class HttpService {
 public:
-    HttpService() = default;
+    HttpService();
     ~HttpService();
     HttpService(const HttpService&) = delete;
     HttpService& operator=(const HttpService&) = delete;
@@ -38,6 +39,7 @@ private:
     mutable std::mutex mutex_;
     std::unique_ptr<httplib::Server> serve_;
     std::thread listener_;
+    std::future<void> listenerEnded_;
     int port_ = 0;
 };
 

@@ -5,6 +5,7 @@
 #include "control/RequestHandle.h"
 #include "control/ResponseHandler.h"
 #include "core/Text.h"
+#include "support/TestSupport.h"
 
 namespace kesu {
 namespace {
@@ -108,6 +109,24 @@ TEST(Dispatcher, HeartbeatAndEmptyAnswers) {
         EXPECT_EQ(HttpService::handleBody(Json({{"event", event}}).dump()), "") << event;
     }
     EXPECT_EQ(HttpService::handleBody(""), "");
+}
+
+}  // namespace
+}  // namespace kesu
+
+namespace kesu {
+namespace {
+
+TEST(ControlServer, StopRightAfterStartDoesNotHang) {
+    test::HermeticEnv env;
+    env.config().controlPort = 0;
+    for (int i = 0; i < 20; ++i) {
+        HttpService service;
+        ASSERT_TRUE(service.startHttpServic());
+        EXPECT_GT(service.port(), 0);
+        service.stop();
+        EXPECT_FALSE(service.isRunning());
+    }
 }
 
 }  // namespace
