@@ -166,9 +166,9 @@ Json RequestBase::http(const std::string& baseUrl, const std::string& path, cons
     const std::string url = baseUrl + path;
 
     Headers headers{{"Content-Type", rawValue(ContentType::json)}};
-    for (const auto& [name, value] : requestHeader) {
-        std::erase_if(headers, [&](const auto& pair) { return sameHeaderName(pair.first, name); });
-        headers[name] = value;
+    for (const auto& header : requestHeader) {
+        std::erase_if(headers, [&](const auto& pair) { return sameHeaderName(pair.first, header.first); });
+        headers[header.first] = header.second;
     }
 
     const Config& config = Config::current();

@@ -1,0 +1,143 @@
+// Phone frames: exact bytes of built frames, and cutting a received stream back into frames
+// whatever way it was split, with garbage, short frames and lying length fields.
+#include "connect/PhoneFrame.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+namespace kesu {
+namespace {
+
+std::string asText(const Bytes& bytes) { return std::string(bytes.begin(), bytes.end()); }
+
+std::string frameText(std::string_view body) { return asText(buildPhoneFrame(body)); }
+
+TEST(PhoneFrame, BuiltFrameBytes) {
+    const Bytes empty = buildPhoneFrame("{}");
+    const Bytes expected = {'P', 'A', 'Y', '_', 'L', 'O', 'A', 'D', '_', '1', 0, 0, 0, 2, '{', '}'};
+    EXPECT_EQ(empty, expected);
+
+    const Bytes big = buildPhoneFrame(std::string(300, 'x'));
+    ASSERT_EQ(big.size(), 314u);
+    EXPECT_EQ((Bytes{big[10], big[11], big[12], big[13]}), (Bytes{0x00, 0x00, 0x01, 0x2C}));
+
+    EXPECT_EQ(lenTo4Bytes(0x01020304), (std::array<std::uint8_t, 4>{1, 2, 3, 4}));
+    EXPECT_EQ(lenTo4Bytes(0x7'0000'0102ULL), (std::array<std::uint8_t, 4>{0, 0, 1, 2}));  // low 32 bits only
+    const std::uint8_t raw[] = {0xFF, 0x00, 0x01, 0x2C};
+    EXPECT_EQ(lenFrom4Bytes(raw), 0xFF00012Cu);
+
+    // JSON bodies: compact UTF-8 by default; bad UTF-8 in a string does not throw.
+    nlohmann::json body = {{"bytes", {0}}, {"deviceName", "书房电脑"}};
+    const Bytes frame = buildPhoneFrameFromJson(body);
+    const std::string text = phoneFrameBody(frame);
+    EXPECT_EQ(text, R"({"bytes":[0],"deviceName":"书房电脑"})");
+    EXPECT_EQ(lenFrom4Bytes(frame.data() + 10), text.size());
+    EXPECT_NE(phoneFrameBody(buildPhoneFrameFromJson(body, 4)).find("\n    \"bytes\""), std::string::npos);
+    EXPECT_NO_THROW(buildPhoneFrameFromJson(nlohmann::json{{"name", std::string("\xff\xfe")}}));
+
+    EXPECT_EQ(phoneFrameBody(Bytes(frame.begin(), frame.begin() + 14)), "");
+    EXPECT_EQ(phoneFrameBody(Bytes{'P', 'A'}), "");
+}
+
+TEST(PhoneFrame, TagOfBody) {
+    EXPECT_EQ(phoneFrameTag(R"({"bytes":[1],"ip":"10.0.0.2"})"), 1);
+    EXPECT_EQ(phoneFrameTag("{\n  \"bytes\" : [\n    11\n  ]\n}"), 11);
+    EXPECT_EQ(phoneFrameTag(R"({"bytes":[0,1]})"), std::nullopt);
+    EXPECT_EQ(phoneFrameTag(R"({"bytes":["1"]})"), std::nullopt);
+    EXPECT_EQ(phoneFrameTag(R"({"bytes":[99999999999]})"), std::nullopt);
+    EXPECT_EQ(phoneFrameTag(R"({"byte":[1]})"), std::nullopt);
+    EXPECT_EQ(phoneFrameTag("[1]"), std::nullopt);
+    EXPECT_EQ(phoneFrameTag("{\"bytes\":[1]"), std::nullopt);
+    EXPECT_EQ(phoneFrameTag(std::string(100000, '[')), std::nullopt);
+}
+
+TEST(PhoneFrame, CutterWholeSplitAndJoinedFrames) {
+    const std::string a = frameText(R"({"bytes":[1]})");
+    const std::string b = frameText(R"({"bytes":[23],"deviceName":"平板"})");
+    const std::string empty = frameText("");
+
+    FrameCutter cutter(1024);
+    cutter.feed(a);
+    EXPECT_EQ(asText(*cutter.next()), a);
+    EXPECT_EQ(cutter.next(), std::nullopt);
+    EXPECT_EQ(cutter.buffered(), 0u);
+
+    // Byte by byte: nothing until the last byte of each frame.
+    const std::string stream = a + empty + b;
+    std::vector<std::string> got;
+    for (char c : stream) {
+        cutter.feed(std::string_view(&c, 1));
+        while (auto f = cutter.next()) got.push_back(asText(*f));
+    }
+    EXPECT_EQ(got, (std::vector<std::string>{a, empty, b}));
+
+    // Two frames and the start of a third in one read.
+    cutter.feed(a + b + b.substr(0, 20));
+    EXPECT_EQ(asText(*cutter.next()), a);
+    EXPECT_EQ(asText(*cutter.next()), b);
+    EXPECT_EQ(cutter.next(), std::nullopt);
+    EXPECT_EQ(cutter.buffered(), 20u);
+    cutter.feed(b.substr(20));
+    EXPECT_EQ(asText(*cutter.next()), b);
+    EXPECT_EQ(cutter.takeDropped(), 0u);
+}
+
+TEST(PhoneFrame, CutterDropsWhatIsNoFrame) {
+    const std::string a = frameText(R"({"bytes":[2]})");
+    FrameCutter cutter(1024);
+
+    // Garbage before a frame, including a false start of the tag.
+    cutter.feed("HTTP/1.1 200 OK\r\nPAY_LOA" + a);
+    EXPECT_EQ(asText(*cutter.next()), a);
+    EXPECT_EQ(cutter.takeDropped(), 24u);
+
+    // Garbage alone keeps at most a tail that may grow into a tag.
+    cutter.feed(std::string(5000, 'z') + "PAY_L");
+    EXPECT_EQ(cutter.next(), std::nullopt);
+    EXPECT_EQ(cutter.buffered(), 5u);
+    cutter.feed(a.substr(5));
+    EXPECT_EQ(asText(*cutter.next()), a);
+    EXPECT_EQ(cutter.takeDropped(), 5000u);
+
+    // Fewer than 14 bytes: a frame too short to hold its length waits, then completes.
+    cutter.feed(a.substr(0, 12));
+    EXPECT_EQ(cutter.next(), std::nullopt);
+    cutter.feed(a.substr(12));
+    EXPECT_EQ(asText(*cutter.next()), a);
+
+    // A length above the limit is never waited for; the frame after it still comes out.
+    std::string huge = "PAY_LOAD_1";
+    huge += std::string("\xff\xff\xff\xf0", 4);
+    cutter.feed(huge + "some body" + a);
+    EXPECT_EQ(asText(*cutter.next()), a);
+    EXPECT_TRUE(cutter.takeOversized());
+    EXPECT_EQ(cutter.takeDropped(), huge.size() + 9);
+    EXPECT_FALSE(cutter.takeOversized());
+    std::string limit = "PAY_LOAD_1";
+    limit += std::string("\x00\x00\x04\x01", 4);  // 1025: one above the limit
+    cutter.feed(limit);
+    EXPECT_EQ(cutter.next(), std::nullopt);
+    EXPECT_TRUE(cutter.takeOversized());
+
+    // A length shorter than the body: the frame ends where the length says, the tail of the
+    // body is dropped as garbage, the next frame is found.
+    cutter.clear();
+    cutter.takeDropped();
+    std::string lying = "PAY_LOAD_1";
+    lying += std::string("\x00\x00\x00\x02", 4);
+    cutter.feed(lying + "{}trailing" + a);
+    EXPECT_EQ(asText(*cutter.next()), lying + "{}");
+    EXPECT_EQ(asText(*cutter.next()), a);
+    EXPECT_EQ(cutter.takeDropped(), 8u);
+
+    // A length longer than what arrived just waits (bounded by the limit).
+    std::string longer = "PAY_LOAD_1";
+    longer += std::string("\x00\x00\x01\x00", 4);
+    cutter.feed(longer + "{}");
+    EXPECT_EQ(cutter.next(), std::nullopt);
+    EXPECT_EQ(cutter.buffered(), 16u);
+}
+
+}  // namespace
+}  // namespace kesu
