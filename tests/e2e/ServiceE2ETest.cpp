@@ -25,6 +25,13 @@ namespace {
 
 constexpr int kControlPort = 9197;
 
+// Sanitizer builds keep shadow memory and quarantines: resident size says nothing there.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kMeasureMemory = false;
+#else
+constexpr bool kMeasureMemory = true;
+#endif
+
 struct Daemon {
     TempDir dir;
     std::string home = dir.str() + "/home";
@@ -172,11 +179,12 @@ TEST(ServiceE2E, SurvivesHostileBodies) {
             ASSERT_TRUE(post(i % 50 == 0 ? nearLimit : "#{\"event\":\"nope\",\"args\":[" + std::to_string(i) + "]}"));
         }
     };
-    junkRound(1000);
+    const int rounds = kMeasureMemory ? 1000 : 100;
+    junkRound(rounds);
     const long before = rssKiB(service->pid());
-    junkRound(1000);
+    junkRound(rounds);
     const long after = rssKiB(service->pid());
-    EXPECT_LT(after - before, 8 * 1024) << before << " KiB -> " << after << " KiB";
+    if (kMeasureMemory) EXPECT_LT(after - before, 8 * 1024) << before << " KiB -> " << after << " KiB";
     EXPECT_TRUE(isAlive(heartbeat()));
     EXPECT_TRUE(service->running());
 }
