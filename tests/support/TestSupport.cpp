@@ -10,6 +10,8 @@
 #include <sstream>
 #include <stdexcept>
 
+#include "pcsuite/DeviceListReporter.h"
+
 namespace kesu::test {
 
 TempDir::TempDir() {
@@ -49,7 +51,11 @@ HermeticEnv::HermeticEnv()
     Config::current() = Config();
 }
 
-HermeticEnv::~HermeticEnv() { Config::current() = saved_; }
+HermeticEnv::~HermeticEnv() {
+    // A pre-connect list report a test set off must not outlive the Config it was sent under.
+    ReportDevicesV2::instance().cancel();
+    Config::current() = saved_;
+}
 
 std::string readAll(const std::string& path) {
     std::ifstream in(path, std::ios::binary);
