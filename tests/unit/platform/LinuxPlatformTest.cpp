@@ -273,10 +273,8 @@ TEST(ProcessHelpers, DetachedProgramIsReaped) {
     EXPECT_EQ(::kill(pid, 0), -1);  // no zombie left behind
     EXPECT_EQ(errno, ESRCH);
 
-    int status = 0;
     EXPECT_EQ(process::runAndWait("sh", {"-c", "exit 9"}, error), 9);
     EXPECT_EQ(process::runAndWait("/no/such/program", {}, error), std::nullopt);
-    (void)status;
 }
 
 // Runs `body` on a thread of its own in a fresh network and mount namespace (root only).
