@@ -1,0 +1,58 @@
+// The lock-guarded table of discovered devices: device id -> latest record. Entries not
+// heard for longer than the expiry go at the next sweep. The table is bounded: when a new
+// id arrives at a full table, the entry heard longest ago makes room for it.
+#pragma once
+
+#include <cstddef>
+#include <map>
+#include <mutex>
+#include <set>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "discovery/SsdpDevice.h"
+
+namespace kesu {
+
+class SsdpSafemap {
+public:
+    // Bound and expiry from Config::current() (ssdpMaxDevices, ssdpDeviceExpiry).
+    SsdpSafemap();
+    SsdpSafemap(std::size_t maxDevices, double expirySeconds);
+
+    // Stores the record under the key, replacing any present one (`cover` changes nothing
+    // visible). A new key in a full table evicts the entry with the oldest lastUpdate.
+    // Always true, except for a null record, which is not stored (false).
+    bool insert(const std::string& opKey, SsdpDevicePtr opValue, bool cover = false);
+    // True and the stored record in `opValue` when present; `opValue` untouched otherwise.
+    bool lookup(const std::string& opKey, SsdpDevicePtr& opValue) const;
+    // Replaces a present record (true); stores nothing for an absent key (false).
+    bool update(const std::string& opKey, SsdpDevicePtr opValue);
+    // All stored records, in no particular order.
+    std::vector<SsdpDevicePtr> getDevicesArray() const;
+    // Removes every entry with now - lastUpdate > expiry (an entry exactly at the expiry
+    // stays); true when at least one went.
+    bool eraseTimeOut(double now);
+
+    std::size_t size() const;
+    std::size_t maxDevices() const { return maxDevices_; }
+    // Entries evicted so far to keep the bound.
+    std::size_t evictedCount() const;
+
+private:
+    void storeLocked(const std::string& key, SsdpDevicePtr value);
+    void eraseLocked(std::map<std::string, SsdpDevicePtr>::iterator it);
+
+    const std::size_t maxDevices_;
+    const double expirySeconds_;
+
+    mutable std::mutex lock;
+    std::map<std::string, SsdpDevicePtr> safeMap;
+    // (lastUpdate, key) of every entry, oldest first: drives eviction and the sweep.
+    std::set<std::pair<double, std::string>> byAge_;
+    std::size_t evicted_ = 0;
+    bool evictionLogged_ = false;  // one log line per stretch of time at the bound
+};
+
+}  // namespace kesu

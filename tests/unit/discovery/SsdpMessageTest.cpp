@@ -1,0 +1,242 @@
+// Discovery datagrams: the PC's announcement and search texts, strict base64, the masking
+// and identifier rules, both announcement parsers, classification of received datagrams and
+// the insertion into the table with its change observer.
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "DiscoveryFixture.h"
+#include "core/Json.h"
+#include "discovery/Base64.h"
+#include "discovery/SsdpDeviceManager.h"
+#include "discovery/SsdpMessage.h"
+
+namespace kesu {
+namespace {
+
+using Handling = SsdpMessage::Handling;
+
+// A current-format announcement as phones send it, around a JSON object.
+std::string announce(const Json& body) {
+    return "RESPONSE * HTTP/1.1\r\nDATE:2024-05-01 10:00:00.000\r\ncompatGsonStr:" +
+           base64::encode(json::compact(body)) + "\r\n";
+}
+
+Json phone(const std::string& id, const std::string& type = "mobile") {
+    return Json{{"deviceName", "kesu X1 Pro"}, {"deviceId", id},          {"openId", "openid-of-this-pc"},
+                {"account", "138****0000"},  {"deviceType", type},        {"pcCustomizedData", "G1"},
+                {"serviceRecord", "com.kesu.pcsuite.SERVICE--com.kesu.share.CONNECT_PC"}};
+}
+
+const std::string kOld =
+    "deviceId:AB12XYZ\r\nopenId:old-open\r\nserviceRecord:com.kesu.pcsuite.SERVICE\r\n"
+    "deviceName:Living Room Tab\r\naccount:user\r\ndeviceType:pad\r\npcCustomizedData:7xyz\r\n";
+
+using SsdpMessageTest = test::DiscoveryTest;
+
+TEST_F(SsdpMessageTest, AnnouncementAndSearchWireFormat) {
+    const std::string msg = SsdpMessage::responseMessage("Off****-PC", "a1b2c3d4e5f6", "138****0000", "oid",
+                                                         SsdpMessage::pcServiceRecord());
+    const std::string head = "RESPONSE * HTTP/1.1\r\nDATE:" + Utils::getNowTime() + "\r\ncompatGsonStr:";
+    ASSERT_EQ(msg.substr(0, head.size()), head);
+    ASSERT_EQ(msg.substr(msg.size() - 2), "\r\n");
+    const std::string b64 = msg.substr(head.size(), msg.size() - head.size() - 2);
+    const auto body = base64::decodeStrict(b64);
+    ASSERT_TRUE(body.has_value());
+    EXPECT_EQ(body->find_first_of(" \n"), std::string::npos);  // compact
+    const Json j = Json::parse(*body);
+    EXPECT_EQ(j, (Json{{"deviceName", "Off****-PC"}, {"deviceId", "a1b2c3d4e5f6"}, {"openId", "oid"},
+                       {"serviceRecord", "com.kesu.pcsuite.SERVICE--com.kesu.share.CONNECT_PC"},
+                       {"port", 10191}, {"account", "138****0000"}, {"deviceType", "pc"}, {"extra", "null"}}));
+
+    EXPECT_EQ(SsdpMessage::searchMessage("dev", "oid", "svc"),
+              "M-SEARCH * HTTP/1.1\nHost:239.255.255.250:2200\nMan:\"ssdp:discover\"\nMX:5\nST:kesu_connect\n"
+              "deviceId:dev\nopenId:oid\nService:svc\r\n");
+}
+
+TEST(SsdpBase64, StrictDecoding) {
+    for (const std::string bytes : {std::string(), std::string("A"), std::string("AB"), std::string("ABC"),
+                                    std::string("\0\xff\x10\x80", 4)}) {
+        EXPECT_EQ(base64::decodeStrict(base64::encode(bytes)), bytes);
+    }
+    EXPECT_EQ(base64::encode("kesu"), "a2VzdQ==");
+    for (const char* bad : {"a2VzdQ", "a2VzdQ=", "a2Vz dQ==", "a2V=zdQ=", "A===", "====", "a2Vz\r\ndQ==",
+                            "a2-_dQ==", "a2VzdQ==a2Vz"}) {
+        EXPECT_FALSE(base64::decodeStrict(bad).has_value()) << bad;
+    }
+}
+
+TEST_F(SsdpMessageTest, MaskingAndIdentifierRules) {
+    bool full = false;
+    EXPECT_EQ(SsdpMessage::maskValue("ABCDEF", full), "ABCDEF");
+    EXPECT_TRUE(full);
+    EXPECT_EQ(SsdpMessage::maskValue("ABCDEFG", full), "ABC****EFG");  // 7 is the first masked length
+    EXPECT_FALSE(full);
+    EXPECT_EQ(SsdpMessage::maskValue("", full), "");
+    EXPECT_TRUE(full);
+    // User-perceived characters: a flag and an accented letter count as one each.
+    const std::string flag = "\xF0\x9F\x87\xA8\xF0\x9F\x87\xB3", e = "e\xCC\x81";
+    EXPECT_EQ(SsdpMessage::maskValue(flag + e + "abcd", full), flag + e + "abcd");
+    EXPECT_TRUE(full);
+    EXPECT_EQ(SsdpMessage::maskValue(flag + e + "abcde", full), flag + e + "a****cde");
+    EXPECT_FALSE(full);
+
+    EXPECT_EQ(SsdpMessage::deviceIdentifier("abc"), "616263");
+    EXPECT_EQ(SsdpMessage::deviceIdentifier("abcdefgh"), "61626364");
+    EXPECT_EQ(SsdpMessage::deviceIdentifier(""), "");
+    EXPECT_EQ(SsdpMessage::deviceIdentifier("\xE8\xAE\xBE\xE5\xA4\x87" "12ZZ"), "e8aebee5a4873132");
+}
+
+TEST_F(SsdpMessageTest, CurrentFormatParse) {
+    SsdpDevice d;
+    ASSERT_TRUE(SsdpMessage::parserResponseData(json::compact(phone("abcdefgh")), d));
+    EXPECT_EQ(d.deviceName, "X1 Pro");
+    EXPECT_TRUE(d.isDeviceNameFull);
+    EXPECT_EQ(d.deviceId, "61626364");
+    EXPECT_EQ(d.account, "138****000");  // 11 characters: first 3, ****, last 3
+    EXPECT_FALSE(d.isAccountFull);
+    EXPECT_EQ(d.openId, "openid-of-this-pc");
+    EXPECT_EQ(d.guide, "G1");
+    EXPECT_EQ(d.deviceType, "phone");
+
+    SsdpDevice p;
+    ASSERT_TRUE(SsdpMessage::parserResponseData(
+        json::compact(Json{{"deviceName", "kesuABCDEFG"}, {"deviceType", "pad"}, {"account", 42}, {"deviceId", "x"}}), p));
+    EXPECT_EQ(p.deviceName, "ABC****EFG");
+    EXPECT_FALSE(p.isDeviceNameFull);
+    EXPECT_EQ(p.deviceType, "pad");
+    EXPECT_EQ(p.account, "");  // not a string
+    EXPECT_TRUE(p.isAccountFull);
+
+    SsdpDevice other;
+    ASSERT_TRUE(SsdpMessage::parserResponseData(R"({"deviceType":"watch","deviceId":"w"})", other));
+    EXPECT_EQ(other.deviceType, "phone");
+    SsdpDevice broken;
+    EXPECT_TRUE(SsdpMessage::parserResponseData("{not json", broken));
+    EXPECT_EQ(broken.deviceId, "");
+    EXPECT_FALSE(SsdpMessage::parserResponseData("", broken));
+}
+
+TEST_F(SsdpMessageTest, OldFormatParse) {
+    SsdpDevice d;
+    ASSERT_TRUE(SsdpMessage::parserOldResponseData(kOld, d));
+    EXPECT_EQ(d.deviceName, "Liv****Tab");
+    EXPECT_FALSE(d.isDeviceNameFull);
+    EXPECT_EQ(d.account, "user");
+    EXPECT_EQ(d.openId, "old-open");
+    EXPECT_EQ(d.deviceId, "41423132");
+    EXPECT_EQ(d.guide, "7");
+    EXPECT_EQ(d.deviceType, "pad");
+
+    auto replaced = [](std::string s, const std::string& from, const std::string& to) {
+        return s.replace(s.find(from), from.size(), to);
+    };
+    SsdpDevice f;
+    EXPECT_FALSE(SsdpMessage::parserOldResponseData(replaced(kOld, "\r\nopenId", "\r\nOPENID"), f));
+    EXPECT_FALSE(SsdpMessage::parserOldResponseData(replaced(kOld, "pcCustomizedData:7xyz\r\n", "pcCustomizedData:"), f));
+    // The account's closing marker before its opening marker.
+    EXPECT_FALSE(SsdpMessage::parserOldResponseData(
+        "deviceId:a\r\nopenId:o\r\nserviceRecord:s\r\ndeviceName:n\r\naccount\r\ndeviceType:mobile\r\naccount:x\r\n"
+        "pcCustomizedData:1", f));
+    EXPECT_FALSE(SsdpMessage::parserOldResponseData("", f));
+}
+
+TEST_F(SsdpMessageTest, DatagramClassification) {
+    SsdpDeviceManager table(64, 30.0);
+    const std::string host = "10.77.0.5";
+
+    EXPECT_EQ(SsdpMessage::handleDatagram(announce(phone("ph01")), host, table), Handling::currentFormat);
+    EXPECT_EQ(table.ssdpDeviceMap.size(), 1u);
+    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), 0.0);
+
+    // The PC's own announcement looped back: not stored, but it proves the socket hears.
+    const std::string own = SsdpMessage::responseMessage(Utils::getLocalName(), "a1b2c3", "", "oid",
+                                                         SsdpMessage::pcServiceRecord());
+    EXPECT_EQ(SsdpMessage::handleDatagram(own, host, table), Handling::ignored);
+    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
+    // So does a phone announcement that merely holds the PC's name somewhere.
+    advance(5);
+    Json naming = phone("ph02");
+    naming["pcCustomizedData"] = "for Off****-PC";
+    EXPECT_EQ(SsdpMessage::handleDatagram(announce(naming), host, table), Handling::currentFormat);
+    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
+
+    // Old-format markers win over the current format.
+    EXPECT_EQ(SsdpMessage::handleDatagram(kOld + "compatGsonStr:" + base64::encode("{}") + "\r\n", host, table),
+              Handling::oldFormat);
+    // A base64 payload broken over lines is joined again.
+    std::string split = announce(phone("ph03"));
+    split.insert(split.find("compatGsonStr:") + 20, "\r\n");
+    EXPECT_EQ(SsdpMessage::handleDatagram(split, host, table), Handling::currentFormat);
+    EXPECT_EQ(table.ssdpDeviceMap.size(), 4u);
+
+    EXPECT_EQ(SsdpMessage::handleDatagram(announce(phone("zz01")) + "\r\n", host, table), Handling::ignored);
+    EXPECT_EQ(SsdpMessage::handleDatagram(announce(phone("zz02", "pc")), host, table), Handling::ignored);
+    Json foreign = phone("zz03");
+    foreign["serviceRecord"] = "com.other.SERVICE";
+    EXPECT_EQ(SsdpMessage::handleDatagram(announce(foreign), host, table), Handling::ignored);
+    EXPECT_EQ(SsdpMessage::handleDatagram(SsdpMessage::searchMessage("d", "o", "com.kesu.pcsuite.SERVICE"), host, table),
+              Handling::ignored);
+    EXPECT_EQ(SsdpMessage::handleDatagram("", host, table), Handling::dropped);
+    EXPECT_EQ(SsdpMessage::handleDatagram(announce(phone("zz04")), "", table), Handling::dropped);
+    EXPECT_EQ(SsdpMessage::handleDatagram("deviceType:mobile com.kesu.pcsuite.SERVICE \xff", host, table),
+              Handling::dropped);
+    EXPECT_EQ(SsdpMessage::handleDatagram("RESPONSE * HTTP/1.1\r\ncompatGsonStr:\r\n", host, table), Handling::dropped);
+    EXPECT_EQ(SsdpMessage::handleDatagram("RESPONSE * HTTP/1.1\r\ncompatGsonStr:e30*\r\n", host, table),
+              Handling::dropped);
+    EXPECT_EQ(SsdpMessage::handleDatagram("compatGsonStr:" + base64::encode("{\"a\":\"\xc3\"}"), host, table),
+              Handling::dropped);
+    EXPECT_EQ(table.ssdpDeviceMap.size(), 4u);
+
+    const std::string log = todaysLog();
+    EXPECT_NE(log.find("[ssdpSocket::udpSocket] data is nil ..."), std::string::npos);
+    EXPECT_NE(log.find("[ssdpSocket::udpSocket] host is nil ..."), std::string::npos);
+    EXPECT_NE(log.find("[ssdpSocket::udpSocket] recvDecodeNSString is nil ..."), std::string::npos);
+}
+
+TEST_F(SsdpMessageTest, InsertionObserverAndRefresh) {
+    SsdpDeviceManager table(64, 30.0);
+    std::vector<std::string> seen;  // what the observer found in the table, per call
+    const auto token = table.addChangeObserver([&](const SsdpDevice& d) {
+        SsdpDevicePtr stored;
+        seen.push_back(table.ssdpDeviceMap.lookup(d.deviceId, stored) ? stored->ip.front() : "absent");
+    });
+
+    SsdpMessage::insertResponseDevice(json::compact(phone("abcd-1")), "10.0.0.1", "openid-of-this-pc", true, table);
+    advance(4);
+    SsdpMessage::insertResponseDevice(json::compact(phone("abcd-2")), "10.0.0.2", "openid-of-this-pc", true, table);
+    EXPECT_EQ(seen, (std::vector<std::string>{"absent", "10.0.0.1"}));
+
+    // Same first 4 characters: one key, the latest announcement in full.
+    SsdpDevicePtr d;
+    ASSERT_TRUE(table.ssdpDeviceMap.lookup("61626364", d));
+    EXPECT_EQ(d->ip, std::vector<std::string>{"10.0.0.2"});
+    EXPECT_EQ(d->lastUpdate, now());
+    EXPECT_TRUE(d->isOpenIdSame);
+    EXPECT_EQ(table.ssdpDeviceMap.size(), 1u);
+
+    // The PC's open id must be set and equal for isOpenIdSame.
+    SsdpMessage::insertResponseDevice(json::compact(phone("efgh")), "10.0.0.3", "", true, table);
+    ASSERT_TRUE(table.ssdpDeviceMap.lookup("65666768", d));
+    EXPECT_FALSE(d->isOpenIdSame);
+
+    // Nothing to store: no sender, no id, failed parse.
+    SsdpMessage::insertResponseDevice(json::compact(phone("ijkl")), "", "x", true, table);
+    SsdpMessage::insertResponseDevice("{}", "10.0.0.4", "x", true, table);
+    SsdpMessage::insertResponseDevice("deviceType:mobile", "10.0.0.4", "x", false, table);
+    EXPECT_EQ(table.ssdpDeviceMap.size(), 2u);
+    EXPECT_EQ(seen.size(), 3u);
+    table.removeChangeObserver(token);
+
+    const std::string log = todaysLog();
+    const std::string inserted =
+        "[ssdpSocket::insertResponseDevice] Insert ssdp device, deviceId: 61626364  account: 138****000  "
+        "openId: openid-of-this-pc  deviceName: X1 Pro  guide: G1  isOpenIdSame: true";
+    EXPECT_NE(log.find(inserted), std::string::npos);
+    EXPECT_EQ(log.find(inserted, log.find(inserted) + 1), std::string::npos);  // the refresh is silent
+    EXPECT_NE(log.find("[ssdpSocket::insertResponseDevice] receive data is empty or parser fail ..."), std::string::npos);
+}
+
+}  // namespace
+}  // namespace kesu
