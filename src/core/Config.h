@@ -26,6 +26,19 @@ struct Config {
     int phoneTcpPort = 10191;
     // Largest phone frame body accepted from a phone; a frame announcing more is dropped.
     std::size_t phoneFrameMaxBody = 1 << 20;
+    // Connections with phones. A PC-initiated request waits activeConnectTimeout for the
+    // phone's answer. The server for phone-initiated requests listens on
+    // phoneServerHost:phoneServerPort (port 0: an ephemeral one, for tests), gives a new link
+    // phoneLinkReadTimeout to deliver its request (then closes it), holds at most
+    // phoneServerMaxLinks links at once, gives an answer phoneAnswerWriteTimeout to leave,
+    // and waits allowWindowTimeout for the user's answer in the allow window.
+    std::chrono::milliseconds activeConnectTimeout{30000};
+    std::string phoneServerHost = "0.0.0.0";
+    int phoneServerPort = 10191;
+    std::chrono::milliseconds phoneLinkReadTimeout{10000};
+    std::chrono::milliseconds phoneAnswerWriteTimeout{5000};
+    std::size_t phoneServerMaxLinks = 16;
+    std::chrono::milliseconds allowWindowTimeout{15000};
     int ssdpPort = 2200;
     std::string ssdpGroup = "239.255.255.250";
     // Discovered-device table: an entry not heard for longer than the expiry goes at the
@@ -33,12 +46,27 @@ struct Config {
     // room for a new one).
     std::chrono::milliseconds ssdpDeviceExpiry{30000};
     std::size_t ssdpMaxDevices = 1024;
+    // Adapter monitor: one adapter check and announcement pass per period; a socket is
+    // rebuilt after a pause; all sockets are rebuilt when the service has not heard its own
+    // announcement for the self-echo time-out.
+    std::chrono::milliseconds ssdpAnnouncePeriod{5000};
+    std::chrono::milliseconds ssdpRebuildPause{1000};
+    std::chrono::milliseconds ssdpSelfEchoTimeout{60000};
+    // Largest discovery datagram read; a longer one is dropped unread.
+    std::size_t ssdpMaxDatagram = 65535;
 
     // How long preconnect_startScan waits for the cloud device list to fill the registry.
     std::chrono::milliseconds preconnectScanWait{5000};
 
     // Screen-lock watcher period.
     std::chrono::milliseconds screenLockPeriod{3000};
+
+    // Device-list reports to the PC suite: the pause after a change (a burst of changes goes
+    // as one list), the least time between two lists of one kind, and the period of the
+    // sweep that drops discovered devices not heard for ssdpDeviceExpiry.
+    std::chrono::milliseconds reportDelay{1000};
+    std::chrono::milliseconds reportThrottle{3000};
+    std::chrono::milliseconds expirySweepPeriod{3000};
 
     // Watchdog of the control server.
     std::chrono::milliseconds httpWatchdogPeriod{120000};
@@ -61,6 +89,12 @@ struct Config {
     std::string serviceExecutable =
         "/Applications/pcsuite.app/Contents/Resources/kesuesService/KesuConnService/KesuConnService";
     std::string switchHostIni = "/Library/Preferences/pcsuite/switch_host.ini";
+    // Programs of phone-initiated connections: the allow window, the PC suite itself, and the
+    // receive folder handed to the sharing application when the account names none.
+    std::string connectStatusExecutable =
+        "/Applications/pcsuite.app/Contents/Resources/ConnectStatus/ConnectStatus.app/Contents/MacOS/ConnectStatus";
+    std::string pcsuiteExecutable = "/Applications/pcsuite.app/Contents/MacOS/pcsuite";
+    std::string shareReceiveFolder = "/Users/recvFile";
 
     // PC suite's account database: the monitor's modification-time poll, and how long one
     // read waits for the PC suite's write lock before it gives up (the old values stay).

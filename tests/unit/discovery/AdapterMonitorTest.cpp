@@ -1,0 +1,351 @@
+// The adapter monitor over the fake platform: the events and socket rebuilds of adapters
+// coming, going, changing address and power, of a network on which the PC stops hearing
+// itself, the announcement pass on a real loopback socket, and the start-up loop's stop.
+#include <gtest/gtest.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <condition_variable>
+#include <mutex>
+
+#include "DiscoveryFixture.h"
+#include "core/Json.h"
+#include "discovery/Base64.h"
+#include "discovery/KesuAdapterManager.h"
+#include "discovery/ServiceWorker.h"
+#include "discovery/SsdpMessage.h"
+#include "events/EventPublisher.h"
+
+namespace kesu {
+namespace {
+
+using namespace std::chrono_literals;
+using Events = std::vector<std::string>;
+using Names = std::vector<std::string>;
+
+// Takes every published event on the publisher's thread, in order.
+class EventRecorder : public IEventSubscriber {
+public:
+    void notify(const std::string& eventName) override {
+        std::lock_guard<std::mutex> l(m_);
+        events_.push_back(eventName);
+        cv_.notify_all();
+    }
+    bool eventNotify(const std::string&) override { return false; }
+    // The events since the last take.
+    Events take() {
+        std::lock_guard<std::mutex> l(m_);
+        return std::exchange(events_, {});
+    }
+    bool waitFor(const std::string& name, std::chrono::milliseconds timeout) {
+        std::unique_lock<std::mutex> l(m_);
+        return cv_.wait_for(l, timeout, [&] { return std::find(events_.begin(), events_.end(), name) != events_.end(); });
+    }
+
+private:
+    std::mutex m_;
+    std::condition_variable cv_;
+    Events events_;
+};
+
+int freeUdpPort() {
+    const int fd = ::socket(AF_INET, SOCK_DGRAM, 0);
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    socklen_t length = sizeof address;
+    ::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address);
+    ::getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length);
+    ::close(fd);
+    return ntohs(address.sin_port);
+}
+
+// One adapter of the fake machine; an empty ip is an adapter without an address.
+struct Adapter {
+    std::string kind;
+    std::string name;
+    std::string ip;
+};
+
+class AdapterMonitor : public test::DiscoveryTest {
+protected:
+    void SetUp() override {
+        DiscoveryTest::SetUp();
+        // Interfaces named here do not exist on this machine: their sockets bind but never
+        // join nor send, so only the monitor's bookkeeping is under test.
+        env.config().ssdpPort = freeUdpPort();
+        env.config().ssdpRebuildPause = 0ms;
+        EventPublisher::instance().addObserver(events);
+    }
+    void TearDown() override {
+        EventPublisher::instance().clearObservers();
+        DiscoveryTest::TearDown();
+    }
+
+    void network(const std::vector<Adapter>& adapters) {
+        std::vector<NetworkService> services;
+        std::vector<InterfaceAddress> addresses;
+        for (const Adapter& a : adapters) {
+            services.push_back({a.kind, a.name, "02:00:00:00:00:0" + std::to_string(services.size())});
+            if (!a.ip.empty()) addresses.push_back({a.name, a.ip, "255.255.255.0", true});
+        }
+        fake->setNetworkServices(services);
+        fake->setInterfaceAddresses(addresses);
+    }
+
+    std::shared_ptr<EventRecorder> events = std::make_shared<EventRecorder>();
+};
+
+const Adapter kWlan{"Wi-Fi", "kf-wlan0", "192.168.5.2"};
+const Adapter kEth{"Ethernet", "kf-eth0", "10.1.1.2"};
+
+TEST_F(AdapterMonitor, StartOpensASocketPerAdapterSilentlyAndTheFirstCheckReportsWifiOn) {
+    fake->setWifiPowerOn(true);
+    network({kWlan, kEth});
+    KesuAdapterManager monitor;
+    EXPECT_TRUE(events->take().empty());
+    EXPECT_EQ(monitor.socketInterfaces(), (Names{"kf-eth0", "kf-wlan0"}));
+    EXPECT_EQ(monitor.networkStatus(),
+              (std::map<std::string, std::string>{{"Ethernet", "10.1.1.2"}, {"Wi-Fi", "192.168.5.2"}}));
+    ASSERT_TRUE(monitor.managerFor("kf-wlan0")->socket());
+    EXPECT_EQ(monitor.managerFor("kf-wlan0")->socket()->netCard, "kf-wlan0");
+    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
+    EXPECT_NE(todaysLog().find(" [netcard status] Currently network card status:"), std::string::npos);
+
+    const auto wlanManager = monitor.managerFor("kf-wlan0");
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"WifiOpenEvent"}));
+    monitor.checkNetWorkStatus();
+    EXPECT_TRUE(events->take().empty());
+    EXPECT_EQ(monitor.managerFor("kf-wlan0"), wlanManager);  // nothing rebuilt
+
+    // Announcing through sockets whose interface is missing sends nothing anywhere.
+    EXPECT_FALSE(wlanManager->sendResponseData("n", "id", "acc", "open", "svc"));
+    monitor.sendSsdp();
+}
+
+TEST_F(AdapterMonitor, UnpluggingAndPluggingEthernetBack) {
+    network({kWlan, kEth});
+    KesuAdapterManager monitor;
+    const auto ethManager = monitor.managerFor("kf-eth0");
+
+    network({kWlan});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"NetworkChangeEvent", "WiredNetDisconnectEvent"}));
+    EXPECT_EQ(monitor.socketInterfaces(), (Names{"kf-wlan0"}));
+    EXPECT_FALSE(ethManager->socket());  // closed, not just forgotten
+    EXPECT_NE(todaysLog().find("[checkNetWorkStatus] adapter remove \n"), std::string::npos);
+    EXPECT_NE(todaysLog().find("[checkNetWorkStatus] ethernetName is kf-eth0 \n"), std::string::npos);
+
+    network({kWlan, kEth});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"NetworkChangeEvent", "WiredNetConnectEvent"}));
+    EXPECT_EQ(monitor.socketInterfaces(), (Names{"kf-eth0", "kf-wlan0"}));
+    EXPECT_NE(monitor.managerFor("kf-eth0"), ethManager);
+    EXPECT_NE(todaysLog().find("[checkNetWorkStatus] adapter add \n"), std::string::npos);
+}
+
+TEST_F(AdapterMonitor, NewAddressesRebuildTheSocketAndReportDisconnectThenConnect) {
+    network({kWlan, kEth});
+    KesuAdapterManager monitor;
+    const auto wlanManager = monitor.managerFor("kf-wlan0");
+    const auto ethManager = monitor.managerFor("kf-eth0");
+
+    network({{"Wi-Fi", "kf-wlan0", "192.168.5.9"}, kEth});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"NetworkChangeEvent", "WlanNetDisconnectEvent", "WlanNetConnectEvent"}));
+    EXPECT_NE(monitor.managerFor("kf-wlan0"), wlanManager);
+    EXPECT_FALSE(wlanManager->socket());
+    EXPECT_EQ(monitor.managerFor("kf-eth0"), ethManager);
+    EXPECT_EQ(monitor.networkStatus().at("Wi-Fi"), "192.168.5.9");
+    EXPECT_NE(todaysLog().find("[checkNetWorkStatus] ip is change \n"), std::string::npos);
+    EXPECT_NE(todaysLog().find("[checkNetWorkStatus] wifiName is kf-wlan0 \n"), std::string::npos);
+
+    // Losing the address keeps the adapter (and a socket on it); getting one back connects.
+    network({{"Wi-Fi", "kf-wlan0", "192.168.5.9"}, {"Ethernet", "kf-eth0", ""}});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"NetworkChangeEvent", "WiredNetDisconnectEvent"}));
+    ASSERT_TRUE(monitor.managerFor("kf-eth0"));
+    EXPECT_TRUE(monitor.managerFor("kf-eth0")->socket());
+    EXPECT_EQ(monitor.networkStatus().at("Ethernet"), "");
+
+    network({{"Wi-Fi", "kf-wlan0", "192.168.5.9"}, kEth});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"NetworkChangeEvent", "WiredNetConnectEvent"}));
+}
+
+TEST_F(AdapterMonitor, WifiPowerOffAndOn) {
+    fake->setWifiPowerOn(true);
+    network({kWlan, kEth});
+    KesuAdapterManager monitor;
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"WifiOpenEvent"}));
+
+    // The radio goes off and the interface stays, without its address.
+    fake->setWifiPowerOn(false);
+    network({{"Wi-Fi", "kf-wlan0", ""}, kEth});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"WifiCloseEvent", "NetworkChangeEvent", "WlanNetDisconnectEvent"}));
+
+    // The interface disappears too: only the removal is new.
+    network({kEth});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"NetworkChangeEvent", "WlanNetDisconnectEvent"}));
+    EXPECT_EQ(monitor.socketInterfaces(), (Names{"kf-eth0"}));
+
+    fake->setWifiPowerOn(true);
+    network({kWlan, kEth});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"WifiOpenEvent", "NetworkChangeEvent", "WlanNetConnectEvent"}));
+    EXPECT_EQ(monitor.socketInterfaces(), (Names{"kf-eth0", "kf-wlan0"}));
+
+    // Power and interface gone in the same check.
+    fake->setWifiPowerOn(false);
+    network({kEth});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"WifiCloseEvent", "NetworkChangeEvent", "WlanNetDisconnectEvent"}));
+}
+
+TEST_F(AdapterMonitor, SilentNetworkRebuildsEverySocketOncePerTimeoutAndOwnEchoOnAnyAdapterPreventsIt) {
+    network({kWlan, kEth});
+    KesuAdapterManager monitor;
+    auto wlan = monitor.managerFor("kf-wlan0");
+    auto eth = monitor.managerFor("kf-eth0");
+
+    advance(60.0);  // exactly the time-out: not yet
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(monitor.managerFor("kf-wlan0"), wlan);
+
+    advance(0.5);
+    monitor.checkNetWorkStatus();
+    EXPECT_TRUE(events->take().empty());
+    EXPECT_NE(monitor.managerFor("kf-wlan0"), wlan);
+    EXPECT_NE(monitor.managerFor("kf-eth0"), eth);
+    EXPECT_FALSE(wlan->socket());
+    EXPECT_FALSE(eth->socket());
+    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());  // reset once for the whole check
+    const std::string timeoutLine =
+        "[checkNetWorkStatus] timeout 60s haven't found myself, ssdp socket maybe block, reinit socket here \n";
+    const std::string log = todaysLog();
+    const auto first = log.find(timeoutLine);
+    ASSERT_NE(first, std::string::npos);
+    EXPECT_NE(log.find(timeoutLine, first + 1), std::string::npos);
+
+    wlan = monitor.managerFor("kf-wlan0");
+    eth = monitor.managerFor("kf-eth0");
+    monitor.checkNetWorkStatus();  // the next check does not rebuild again
+    EXPECT_EQ(monitor.managerFor("kf-wlan0"), wlan);
+
+    // One socket heard the PC's own announcement 30 s ago: no socket is rebuilt, although
+    // the last rebuild is 70 s old.
+    advance(40.0);
+    Utils::setSsdpDetectedLastTime(now());
+    advance(30.0);
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(monitor.managerFor("kf-wlan0"), wlan);
+    EXPECT_EQ(monitor.managerFor("kf-eth0"), eth);
+}
+
+TEST_F(AdapterMonitor, SocketFollowsItsAdapterToAnotherInterface) {
+    network({kWlan, kEth});
+    KesuAdapterManager monitor;
+    const auto eth0 = monitor.managerFor("kf-eth0");
+
+    network({kWlan, {"Ethernet", "kf-eth1", "10.1.1.7"}});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"NetworkChangeEvent", "WiredNetDisconnectEvent", "WiredNetConnectEvent"}));
+    EXPECT_EQ(monitor.socketInterfaces(), (Names{"kf-eth1", "kf-wlan0"}));
+    EXPECT_FALSE(eth0->socket());
+
+    // Same address on yet another interface: no event, but the socket moves.
+    network({kWlan, {"Ethernet", "kf-eth2", "10.1.1.7"}});
+    monitor.checkNetWorkStatus();
+    EXPECT_TRUE(events->take().empty());
+    EXPECT_EQ(monitor.socketInterfaces(), (Names{"kf-eth2", "kf-wlan0"}));
+
+    network({kWlan});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"NetworkChangeEvent", "WiredNetDisconnectEvent"}));
+    EXPECT_EQ(monitor.socketInterfaces(), (Names{"kf-wlan0"}));
+}
+
+// Ethernet is the loopback interface here, so the announcement really goes out and comes
+// back: the PC hears itself, and that keeps its socket from being rebuilt.
+TEST_F(AdapterMonitor, AnnouncesThePcOnEachSocketAndHearsItself) {
+    const std::string savedPhone = dataInstance().get(&databaseParam::Phone);
+    dataInstance().set(&databaseParam::Phone, "138****0000");
+    network({{"Ethernet", "lo", "127.0.0.1"}});
+
+    std::mutex m;
+    std::condition_variable cv;
+    std::vector<std::string> heard;  // by the monitor's own socket, after classification
+    auto record = [&](std::string_view data, const std::string& host, std::uint16_t) {
+        SsdpMessage::handleDatagram(data, host);
+        std::lock_guard<std::mutex> l(m);
+        heard.emplace_back(data);
+        cv.notify_all();
+    };
+    KesuAdapterManager monitor(record);
+    ASSERT_TRUE(monitor.managerFor("lo"));
+    ASSERT_TRUE(monitor.managerFor("lo")->socket()->isReceiving());
+
+    advance(50.0);
+    monitor.sendSsdp();
+    {
+        std::unique_lock<std::mutex> l(m);
+        ASSERT_TRUE(cv.wait_for(l, 10s, [&] { return !heard.empty(); }));
+    }
+    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
+
+    const std::string datagram = heard.front();
+    ASSERT_TRUE(datagram.starts_with("RESPONSE * HTTP/1.1\r\nDATE:"));
+    const Json pc = json::parse(SsdpMessage::decodeCompatPayload(datagram)).value_or(Json());
+    EXPECT_EQ(pc, (Json{{"deviceName", "Off****-PC"},
+                        {"deviceId", Utils::getMacAddress()},
+                        {"openId", "openid-of-this-pc"},
+                        {"serviceRecord", "com.kesu.pcsuite.SERVICE--com.kesu.share.CONNECT_PC"},
+                        {"port", 10191},
+                        {"account", "138****0000"},
+                        {"deviceType", "pc"},
+                        {"extra", "null"}}));
+
+    const auto socketBefore = monitor.managerFor("lo");
+    advance(30.0);  // 80 s after the start, 30 s after the echo
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(monitor.managerFor("lo"), socketBefore);
+    dataInstance().set(&databaseParam::Phone, savedPhone);
+}
+
+// The start-up loop: its first pass runs at once, and stop() ends it during a long period
+// and a long rebuild pause; a new start opens the sockets again from scratch.
+TEST_F(AdapterMonitor, ServiceWorkerStopsAtOnceAndStartsAfresh) {
+    env.config().ssdpAnnouncePeriod = std::chrono::hours(1);
+    env.config().ssdpRebuildPause = std::chrono::hours(1);
+    env.config().ssdpSelfEchoTimeout = 0ms;  // every check rebuilds...
+    std::atomic<double> ticking{kStart};
+    Utils::setClock([&ticking] {  // ...as each reading of the clock is a second later
+        return Utils::Clock::time_point(std::chrono::duration_cast<Utils::Clock::duration>(
+            std::chrono::duration<double>(ticking.fetch_add(1.0))));
+    });
+    fake->setWifiPowerOn(true);
+    network({kEth});
+
+    ServiceWorker worker;
+    for (int round = 0; round < 2; ++round) {
+        worker.start();
+        EXPECT_TRUE(worker.isRunning());
+        EXPECT_TRUE(KesuAdapterManager::instance().isActive());
+        ASSERT_TRUE(events->waitFor("WifiOpenEvent", 10s));  // the check has begun
+        worker.stop();
+        EXPECT_FALSE(worker.isRunning());
+        EXPECT_FALSE(KesuAdapterManager::instance().isActive());
+        EXPECT_TRUE(KesuAdapterManager::instance().socketInterfaces().empty());
+        EXPECT_EQ(events->take(), (Events{"WifiOpenEvent"}));
+    }
+    worker.stop();  // a second stop is harmless
+    Utils::setClock({});
+}
+
+}  // namespace
+}  // namespace kesu

@@ -1,0 +1,402 @@
+// The discovery sockets with real datagrams: on the loopback interface (announcements into
+// the device table and the control API's SSDPQueryAll, the PC hearing itself, oversized and
+// empty datagrams, failed set-up, close and rebuild), and across network namespaces (one
+// socket per adapter hears and speaks only on its own network).
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <net/if.h>
+#include <netinet/in.h>
+#include <sched.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <condition_variable>
+#include <future>
+#include <iostream>
+#include <mutex>
+#include <thread>
+
+#include "DiscoveryFixture.h"
+#include "control/HttpService.h"
+#include "core/Json.h"
+#include "core/Process.h"
+#include "discovery/Base64.h"
+#include "discovery/KesuAdapterManager.h"
+#include "discovery/SsdpDeviceManager.h"
+#include "discovery/SsdpMessage.h"
+#include "discovery/SsdpSocket.h"
+#include "discovery/SsdpSocketManager.h"
+
+namespace kesu {
+namespace {
+
+using namespace std::chrono_literals;
+
+struct Heard {
+    std::string data;
+    std::string host;
+};
+
+// A socket's receiver that keeps what it hears (after the discovery classification when
+// asked to), so that a test can wait for the n-th datagram.
+class Recorder {
+public:
+    explicit Recorder(bool classify) : classify_(classify) {}
+    SsdpSocket::Receiver receiver() {
+        return [this](std::string_view data, const std::string& host, std::uint16_t) {
+            if (classify_) SsdpMessage::handleDatagram(data, host);
+            std::lock_guard<std::mutex> l(m_);
+            heard_.push_back({std::string(data), host});
+            cv_.notify_all();
+        };
+    }
+    // Waits until `count` datagrams from senders other than `except` arrived; those ones.
+    std::vector<Heard> waitFor(std::size_t count, const std::string& except = "") {
+        std::unique_lock<std::mutex> l(m_);
+        std::vector<Heard> picked;
+        cv_.wait_for(l, 10s, [&] {
+            picked.clear();
+            for (const Heard& h : heard_)
+                if (h.host != except) picked.push_back(h);
+            return picked.size() >= count;
+        });
+        return picked;
+    }
+
+private:
+    const bool classify_;
+    std::mutex m_;
+    std::condition_variable cv_;
+    std::vector<Heard> heard_;
+};
+
+int freeUdpPort() {
+    const int fd = ::socket(AF_INET, SOCK_DGRAM, 0);
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    socklen_t length = sizeof address;
+    ::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address);
+    ::getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length);
+    ::close(fd);
+    return ntohs(address.sin_port);
+}
+
+// A phone's announcement in the current format.
+std::string phoneAnnouncement(const std::string& id, const std::string& name) {
+    const Json body{{"deviceName", name},     {"deviceId", id},          {"openId", "phone-open-id"},
+                    {"account", "138****5678"}, {"deviceType", "mobile"}, {"pcCustomizedData", "1"},
+                    {"serviceRecord", "com.kesu.pcsuite.SERVICE--com.kesu.share.CONNECT_PC"}};
+    return "RESPONSE * HTTP/1.1\r\nDATE:2024-05-01 10:00:00.000\r\ncompatGsonStr:" +
+           base64::encode(json::compact(body)) + "\r\n";
+}
+
+// A phone on this machine: sends to the group over the loopback interface from 127.0.0.1.
+class LoopbackPhone {
+public:
+    explicit LoopbackPhone(int port) : port_(port) {
+        fd_ = ::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+        sockaddr_in local{};
+        local.sin_family = AF_INET;
+        local.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        ::bind(fd_, reinterpret_cast<sockaddr*>(&local), sizeof local);
+        ip_mreqn interface{};
+        interface.imr_ifindex = static_cast<int>(if_nametoindex("lo"));
+        ::setsockopt(fd_, IPPROTO_IP, IP_MULTICAST_IF, &interface, sizeof interface);
+    }
+    ~LoopbackPhone() { ::close(fd_); }
+    bool send(const std::string& text) const {
+        sockaddr_in group{};
+        group.sin_family = AF_INET;
+        group.sin_port = htons(static_cast<std::uint16_t>(port_));
+        group.sin_addr.s_addr = htonl(0xEFFFFFFA);  // 239.255.255.250
+        return ::sendto(fd_, text.data(), text.size(), 0, reinterpret_cast<sockaddr*>(&group), sizeof group) ==
+               static_cast<ssize_t>(text.size());
+    }
+
+private:
+    int fd_ = -1;
+    int port_;
+};
+
+Json queryAll() {
+    const std::string answer = HttpService::handleBody(R"({"event":"SSDPQueryAll","args":[]})");
+    const auto hash = answer.find('#');
+    if (hash == std::string::npos) return Json();
+    return json::parse(answer.substr(hash + 1)).value_or(Json());
+}
+
+class SsdpSocketTest : public test::DiscoveryTest {
+protected:
+    void TearDown() override {
+        SsdpDeviceManager::instance().ssdpDeviceMap.eraseTimeOut(1e300);  // the table is process-wide
+        DiscoveryTest::TearDown();
+    }
+};
+
+TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
+    env.config().ssdpPort = freeUdpPort();
+    env.config().ssdpMaxDatagram = 1024;
+    Recorder pcHeard(/*classify=*/true);
+    SsdpSocketManager pc(pcHeard.receiver());
+    EXPECT_FALSE(pc.sendResponseData("n", "id", "acc", "open", "svc"));  // no socket yet
+    pc.createSocket("lo");
+    const std::shared_ptr<SsdpSocket> socket = pc.socket();
+    ASSERT_TRUE(socket);
+    ASSERT_TRUE(socket->isReceiving());
+    EXPECT_TRUE(socket->isBoundToDevice());
+    EXPECT_EQ(socket->localPort(), env.config().ssdpPort);
+    EXPECT_NE(todaysLog().find("[SsdpSocket::initSocket] bind success"), std::string::npos);
+    EXPECT_NE(todaysLog().find("[SsdpSocket::initSocket] beginReceiving success"), std::string::npos);
+
+    // A phone's announcement lands in the table and in the control API's answer.
+    LoopbackPhone phone(env.config().ssdpPort);
+    ASSERT_TRUE(phone.send(phoneAnnouncement("AB12CD34", "kesu X1 Pro")));
+    ASSERT_EQ(pcHeard.waitFor(1).size(), 1u);
+    Json devices = queryAll()["data"];
+    ASSERT_EQ(devices.size(), 1u);
+    EXPECT_EQ(devices[0]["deviceId"], "41423132");
+    EXPECT_EQ(devices[0]["deviceName"], "X1 Pro");
+    EXPECT_EQ(devices[0]["ip"], Json::array({"127.0.0.1"}));
+    EXPECT_EQ(devices[0]["deviceType"], "phone");
+
+    // A datagram longer than the bound is dropped whole; the empty one after it is handed on
+    // (and dropped by the classification with its log line).
+    ASSERT_TRUE(phone.send(std::string(1500, 'x')));
+    ASSERT_TRUE(phone.send(""));
+    auto heard = pcHeard.waitFor(2);
+    ASSERT_EQ(heard.size(), 2u);
+    EXPECT_EQ(heard[1].data, "");
+    EXPECT_NE(todaysLog().find("[SsdpSocket::udpSocket] datagram of 1500 bytes is longer than 1024, dropped"),
+              std::string::npos);
+    EXPECT_NE(todaysLog().find("[ssdpSocket::udpSocket] data is nil ...\n"), std::string::npos);
+
+    // The PC's own announcement comes back on its socket: it refreshes the own-echo time
+    // stamp and is not stored.
+    Utils::setSsdpDetectedLastTime(0.0);
+    ASSERT_TRUE(pc.sendResponseData(Utils::getLocalName(), Utils::getMacAddress(), "", "openid-of-this-pc",
+                                    SsdpMessage::pcServiceRecord()));
+    heard = pcHeard.waitFor(3);
+    ASSERT_EQ(heard.size(), 3u);
+    EXPECT_TRUE(heard[2].data.starts_with("RESPONSE * HTTP/1.1\r\nDATE:"));
+    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
+
+    // The search message goes out as built and is ignored on arrival.
+    ASSERT_TRUE(pc.sendSearchData("pc-id", "open-id", "svc"));
+    heard = pcHeard.waitFor(4);
+    ASSERT_EQ(heard.size(), 4u);
+    EXPECT_EQ(heard[3].data, SsdpMessage::searchMessage("pc-id", "open-id", "svc"));
+    EXPECT_EQ(queryAll()["data"].size(), 1u);
+
+    EXPECT_FALSE(socket->sendMsg(std::string("\xff\xfe")));
+    EXPECT_NE(todaysLog().find("[SsdpSocket::senMsg]data format error"), std::string::npos);
+    EXPECT_FALSE(socket->initial(10191, "127.0.0.1", 1));
+
+    // Deleting closes the socket even while someone still holds it.
+    pc.deleteSocket();
+    EXPECT_FALSE(pc.socket());
+    EXPECT_FALSE(pc.sendResponseData("n", "id", "acc", "open", "svc"));
+    EXPECT_TRUE(socket->isSocketNull());
+    EXPECT_FALSE(socket->isReceiving());
+    EXPECT_FALSE(socket->sendMsg("late"));
+}
+
+TEST_F(SsdpSocketTest, FailedSetUpIsLoggedAndLeavesASocketThatNeitherHearsNorSends) {
+    env.config().ssdpPort = freeUdpPort();
+    {
+        SsdpSocket missing("kf-none0");
+        EXPECT_NE(todaysLog().find("[SsdpSocket::initSocket] Error occur as:No such device"), std::string::npos);
+        EXPECT_FALSE(missing.isReceiving());
+        EXPECT_FALSE(missing.isSocketNull());  // created and bound: it exists
+        // Without its interface the system would send through another adapter.
+        EXPECT_FALSE(missing.sendMsg("hello"));
+    }
+    EXPECT_NE(todaysLog().find("[SsdpSocket::deinit] close and delete a ssdp socket"), std::string::npos);
+
+    env.config().ssdpGroup = "10.77.0.9";  // not a multicast group
+    SsdpSocket notAGroup("lo");
+    EXPECT_FALSE(notAGroup.isReceiving());
+    EXPECT_FALSE(notAGroup.sendMsg("hello"));
+}
+
+// Sockets of one port side by side, rebuilt in a row, closed while another thread sends,
+// and one closed from its own receiver.
+TEST_F(SsdpSocketTest, SharedPortRebuildsAndCloseFromAnyThread) {
+    env.config().ssdpPort = freeUdpPort();
+    Recorder keeper(false);
+    SsdpSocket listener("lo", keeper.receiver());  // stays up across the rebuilds
+    ASSERT_TRUE(listener.isReceiving());
+
+    SsdpSocketManager manager;
+    for (int i = 0; i < 10; ++i) {
+        manager.createSocket("lo");  // replaces, and so closes, the previous socket
+        ASSERT_TRUE(manager.socket()->isReceiving()) << "rebuild " << i;
+    }
+    std::atomic<bool> sending{true};
+    std::thread sender([&] {
+        while (sending.load()) manager.sendSearchData("x", "y", "z");
+    });
+    auto current = manager.socket();
+    ASSERT_FALSE(keeper.waitFor(1).empty());
+    current->close();  // while the sender thread keeps queueing
+    manager.deleteSocket();
+    sending.store(false);
+    sender.join();
+    EXPECT_TRUE(current->isSocketNull());
+
+    std::atomic<SsdpSocket*> self{nullptr};
+    std::promise<void> closedItself;
+    SsdpSocket selfClosing("lo", [&](std::string_view, const std::string&, std::uint16_t) {
+        if (SsdpSocket* s = self.exchange(nullptr)) {
+            s->close();
+            closedItself.set_value();
+        }
+    });
+    self.store(&selfClosing);
+    LoopbackPhone phone(env.config().ssdpPort);
+    ASSERT_TRUE(phone.send("ping"));
+    ASSERT_EQ(closedItself.get_future().wait_for(10s), std::future_status::ready);
+    EXPECT_TRUE(selfClosing.isSocketNull());
+}
+
+// ---- Across network namespaces -----------------------------------------------------------
+
+// Three namespaces: the PC with two adapters (kf-a0 10.77.0.1, kf-b0 10.77.0.5), each joined
+// by a veth pair to a phone's namespace (kf-a1 10.77.0.2, kf-b1 10.77.0.6). Only the phones
+// and the PC's first adapter have a multicast route. Everything is removed at the end.
+class NetnsLab {
+public:
+    NetnsLab() : prefix_("kesu-f-" + std::to_string(::getpid())) {}
+    ~NetnsLab() {
+        for (const char* role : {"pc", "pa", "pb"}) ip({"netns", "del", ns(role)});
+    }
+    std::string ns(const std::string& role) const { return prefix_ + "-" + role; }
+
+    // Empty when the lab is up, else what failed.
+    std::string up() {
+        const std::string pc = ns("pc"), pa = ns("pa"), pb = ns("pb");
+        const std::vector<std::vector<std::string>> steps = {
+            {"netns", "add", pc},
+            {"netns", "add", pa},
+            {"netns", "add", pb},
+            {"-n", pc, "link", "set", "lo", "up"},
+            {"-n", pa, "link", "set", "lo", "up"},
+            {"-n", pb, "link", "set", "lo", "up"},
+            {"-n", pc, "link", "add", "kf-a0", "type", "veth", "peer", "name", "kf-a1", "netns", pa},
+            {"-n", pc, "link", "add", "kf-b0", "type", "veth", "peer", "name", "kf-b1", "netns", pb},
+            {"-n", pc, "addr", "add", "10.77.0.1/30", "dev", "kf-a0"},
+            {"-n", pc, "addr", "add", "10.77.0.5/30", "dev", "kf-b0"},
+            {"-n", pa, "addr", "add", "10.77.0.2/30", "dev", "kf-a1"},
+            {"-n", pb, "addr", "add", "10.77.0.6/30", "dev", "kf-b1"},
+            {"-n", pc, "link", "set", "kf-a0", "up"},
+            {"-n", pc, "link", "set", "kf-b0", "up"},
+            {"-n", pa, "link", "set", "kf-a1", "up"},
+            {"-n", pb, "link", "set", "kf-b1", "up"},
+            {"-n", pc, "route", "add", "224.0.0.0/4", "dev", "kf-a0"},
+            {"-n", pa, "route", "add", "224.0.0.0/4", "dev", "kf-a1"},
+            {"-n", pb, "route", "add", "224.0.0.0/4", "dev", "kf-b1"},
+        };
+        for (const auto& step : steps) {
+            if (!ip(step)) {
+                std::string text = "ip";
+                for (const auto& arg : step) text += " " + arg;
+                return text + " failed";
+            }
+        }
+        return "";
+    }
+
+    // Runs `make` on a thread that entered namespace `role`: sockets it creates live there.
+    template <class F>
+    auto inside(const std::string& role, F make) -> decltype(make()) {
+        decltype(make()) made{};
+        std::thread([&] {
+            const int fd = ::open(("/run/netns/" + ns(role)).c_str(), O_RDONLY | O_CLOEXEC);
+            if (fd < 0) return;
+            const bool entered = ::setns(fd, CLONE_NEWNET) == 0;
+            ::close(fd);
+            if (entered) made = make();
+        }).join();
+        return made;
+    }
+
+private:
+    static bool ip(const std::vector<std::string>& args) {
+        const auto result = process::run("ip", args, 10s);
+        return result && result->exitStatus == 0;
+    }
+    std::string prefix_;
+};
+
+TEST_F(SsdpSocketTest, NetnsEachAdapterSocketHearsAndSpeaksOnlyOnItsOwnNetwork) {
+    if (::geteuid() != 0) {
+        std::cerr << "*** SKIPPED: network namespaces need root; per-adapter delivery is NOT tested ***\n";
+        GTEST_SKIP() << "network namespaces need root";
+    }
+    NetnsLab lab;
+    if (const std::string failed = lab.up(); !failed.empty()) {
+        std::cerr << "*** SKIPPED: " << failed << "; per-adapter delivery is NOT tested ***\n";
+        GTEST_SKIP() << failed;
+    }
+    // The real discovery port: nothing else listens inside these namespaces.
+    Recorder pcA(true), pcB(true), phoneA(false), phoneB(false);
+    auto socketOn = [&](const std::string& role, const std::string& netCard, Recorder& recorder) {
+        return lab.inside(role, [&] { return std::make_unique<SsdpSocket>(netCard, recorder.receiver()); });
+    };
+    auto pcSocketA = socketOn("pc", "kf-a0", pcA);
+    auto pcSocketB = socketOn("pc", "kf-b0", pcB);
+    auto phoneSocketA = socketOn("pa", "kf-a1", phoneA);
+    auto phoneSocketB = socketOn("pb", "kf-b1", phoneB);
+    for (auto* s : {pcSocketA.get(), pcSocketB.get(), phoneSocketA.get(), phoneSocketB.get()}) {
+        ASSERT_TRUE(s && s->isReceiving() && s->isBoundToDevice());
+    }
+
+    // Phone A, then phone B, then phone A again. Had one PC socket also heard the other
+    // network, the stray datagram would sit in its queue before the expected ones.
+    const std::string a1 = phoneAnnouncement("PHA-0001", "kesu Phone A");
+    const std::string b1 = phoneAnnouncement("PHB-0002", "kesu Phone B");
+    const std::string a2 = phoneAnnouncement("PHA-0001", "kesu Phone A2");
+    ASSERT_TRUE(phoneSocketA->sendMsg(a1));
+    ASSERT_EQ(pcA.waitFor(1).size(), 1u);
+    ASSERT_TRUE(phoneSocketB->sendMsg(b1));
+    const auto heardB = pcB.waitFor(1);
+    ASSERT_EQ(heardB.size(), 1u);
+    EXPECT_EQ(heardB[0].data, b1);
+    EXPECT_EQ(heardB[0].host, "10.77.0.6");
+    ASSERT_TRUE(phoneSocketA->sendMsg(a2));
+    const auto heardA = pcA.waitFor(2);
+    ASSERT_EQ(heardA.size(), 2u);
+    EXPECT_EQ(heardA[0].data, a1);
+    EXPECT_EQ(heardA[1].data, a2);
+    EXPECT_EQ(heardA[0].host, "10.77.0.2");
+
+    // Both phones are in the table, each with the address of its own network.
+    const Json devices = queryAll()["data"];
+    ASSERT_EQ(devices.size(), 2u);
+    std::map<std::string, Json> byId;
+    for (const Json& d : devices) byId[d["deviceId"].get<std::string>()] = d;
+    EXPECT_EQ(byId["5048412d"]["ip"], Json::array({"10.77.0.2"}));
+    EXPECT_EQ(byId["5048412d"]["deviceName"], "Pho**** A2");  // the later announcement won
+    EXPECT_EQ(byId["5048422d"]["ip"], Json::array({"10.77.0.6"}));
+
+    // The adapter monitor's announcement leaves on each adapter, the first datagram of each
+    // new socket included, although only kf-a0 has a multicast route.
+    fake->addAdapter("Wi-Fi", "kf-a0", "02:00:00:00:0a:00", "10.77.0.1", "255.255.255.252");
+    fake->addAdapter("Ethernet", "kf-b0", "02:00:00:00:0b:00", "10.77.0.5", "255.255.255.252");
+    auto monitor = lab.inside("pc", [] { return std::make_unique<KesuAdapterManager>(); });
+    ASSERT_TRUE(monitor);
+    EXPECT_EQ(monitor->socketInterfaces(), (std::vector<std::string>{"kf-a0", "kf-b0"}));
+    monitor->sendSsdp();
+    const auto pcOnA = phoneA.waitFor(1, "10.77.0.2");  // besides its own echoes
+    const auto pcOnB = phoneB.waitFor(1, "10.77.0.6");
+    ASSERT_EQ(pcOnA.size(), 1u);
+    ASSERT_EQ(pcOnB.size(), 1u);
+    EXPECT_EQ(pcOnA[0].host, "10.77.0.1");
+    EXPECT_EQ(pcOnB[0].host, "10.77.0.5");
+    const Json announced = json::parse(SsdpMessage::decodeCompatPayload(pcOnB[0].data)).value_or(Json());
+    EXPECT_EQ(announced["deviceType"], "pc");
+    EXPECT_EQ(announced["deviceName"], "Off****-PC");
+}
+
+}  // namespace
+}  // namespace kesu
