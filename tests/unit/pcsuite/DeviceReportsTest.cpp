@@ -1,0 +1,343 @@
+// Device-list reports: the change rule, the delay/throttle/coalescing of sends, the network
+// and application tests, the expiry loop, and the start-up wiring, all against a stub PC
+// suite on loopback that records what was posted.
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <memory>
+#include <string>
+
+#include "control/HttpService.h"
+#include "core/ServiceManager.h"
+#include "discovery/SsdpDeviceManager.h"
+#include "discovery/SsdpMessage.h"
+#include "pcsuite/DeviceReports.h"
+#include "preconnect/DeviceWaitForPreConnectManager.h"
+#include "support/StubPcSuite.h"
+#include "unit/discovery/DiscoveryFixture.h"
+
+namespace kesu {
+namespace {
+
+using namespace std::chrono_literals;
+
+const char* const kLanPath = "/SSDPQueryAll";
+const char* const kPreconnectPath = "/RH2RF_PUSH_GATT_CLIENT_LIST";
+
+// A phone's announcement payload (current format).
+Json phone(const std::string& id, const std::string& account = "138****0000", const std::string& guide = "G1",
+           const std::string& openId = "openid-of-this-pc") {
+    return Json{{"deviceName", "kesu X1 Pro"}, {"deviceId", id},     {"openId", openId},
+                {"account", account},        {"deviceType", "mobile"}, {"pcCustomizedData", guide},
+                {"serviceRecord", "com.kesu.pcsuite.SERVICE--com.kesu.share.CONNECT_PC"}};
+}
+
+// The list element the PC suite receives for phone(id...) heard from `ip`.
+std::string element(const std::string& hexId, const std::string& ip, const std::string& account = "138****000") {
+    return R"({"account":")" + account + R"(","deviceId":")" + hexId +
+           R"(","deviceName":"X1 Pro","deviceType":"phone","guide":"G1","ip":[")" + ip +
+           R"("],"isAccountFull":false,"isDeviceNameFull":true,"isOpenIdSame":true,"openId":"openid-of-this-pc"})";
+}
+
+// Waits until `count` requests for `path` have arrived (other paths may arrive meanwhile).
+bool waitForPath(const test::StubPcSuite& stub, const std::string& path, std::size_t count,
+                 std::chrono::milliseconds timeout) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+        if (stub.requestsTo(path).size() >= count) return true;
+        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+        if (left <= 0ms || !stub.waitForRequests(stub.requestCount() + 1, left))
+            return stub.requestsTo(path).size() >= count;
+    }
+}
+
+// Every recorded request as "METHOD path", for failure messages.
+std::string seen(const test::StubPcSuite& stub) {
+    std::string out;
+    for (const auto& r : stub.requests()) out += r.method + " " + r.path + "; ";
+    return out;
+}
+
+// A pre-connect entry as the registry holds it; only its PC suite form matters here.
+class ListedEntry : public IDeviceWaitForPreConnect {
+public:
+    explicit ListedEntry(Json info) : info_(std::move(info)) {}
+    std::string getDeviceId() const override { return json::str(info_, "id"); }
+    bool getIsConnected() const override { return json::boolean(info_, "isConnected"); }
+    bool getIsFarawayDiscovered() const override { return true; }
+    Json getPcsuiteDeviceInfo() const override { return info_; }
+    void setIsDisconnectNow(bool) override {}
+    void reduceConnectCount() override {}
+    void resetConnectCount() override {}
+    void setFirstConnect(bool) override {}
+    void disconnectPreConnect() override {}
+
+private:
+    Json info_;
+};
+
+class DeviceReportsTest : public test::DiscoveryTest {
+protected:
+    void SetUp() override {
+        test::DiscoveryTest::SetUp();
+        pcsuite.pointPcsuiteHere(env.config());
+        env.config().httpWaitTimeout = 5s;
+        env.config().reportDelay = 20ms;
+        env.config().reportThrottle = 100ms;
+        env.config().expirySweepPeriod = 20ms;
+        fake->addAdapter("Ethernet", "eth0", "aa:bb:cc:dd:ee:01", "192.168.1.20");
+    }
+
+    // Waits for the n-th request to `path` (LAN list unless told).
+    bool reports(std::size_t n, std::chrono::milliseconds timeout, const std::string& path = kLanPath) {
+        return waitForPath(pcsuite, path, n, timeout);
+    }
+
+    void hear(const Json& announcement, const std::string& ip) {
+        SsdpMessage::insertResponseDevice(json::compact(announcement), ip, "openid-of-this-pc", true, table);
+    }
+
+    test::StubPcSuite pcsuite;
+    SsdpDeviceManager table{64, 30.0};
+};
+
+TEST_F(DeviceReportsTest, OnlyNewDevicesAndAccountGuideOpenIdChangesCount) {
+    env.config().reportDelay = 1h;  // nothing is sent: a waiting report shows a notification
+    WlanDetectedDeviceCompare compare(table);
+    auto reporter = std::make_shared<WlanReportDevices>(table);
+    compare.addObserver(reporter);
+    auto notified = [&] {
+        const bool waiting = !reporter->waitIdle(0ms);
+        reporter->cancel();
+        return waiting;
+    };
+
+    // Through the table's hook, as announcements arrive.
+    hear(phone("abcd"), "10.0.0.1");
+    EXPECT_TRUE(notified());  // new
+    advance(5);
+    hear(phone("abcd"), "10.0.0.9");
+    EXPECT_FALSE(notified());  // same values, another address and time
+    hear(phone("abcd", "139****1111"), "10.0.0.1");
+    EXPECT_TRUE(notified());  // account
+
+    // The rule field by field against the stored record.
+    SsdpDevicePtr stored;
+    ASSERT_TRUE(table.ssdpDeviceMap.lookup("61626364", stored));
+    auto with = [&](auto change) {
+        SsdpDevice d = *stored;
+        change(d);
+        return compare.checkWhetherDeviceChange(d);
+    };
+    EXPECT_FALSE(with([](SsdpDevice& d) { d.deviceName = "Other"; }));
+    EXPECT_FALSE(with([](SsdpDevice& d) { d.ip = {"10.9.9.9"}; }));
+    EXPECT_FALSE(with([](SsdpDevice& d) { d.deviceType = "pad"; }));
+    EXPECT_FALSE(with([](SsdpDevice& d) { d.lastUpdate += 100; }));
+    EXPECT_FALSE(with([](SsdpDevice& d) { d.isAccountFull = !d.isAccountFull; }));
+    EXPECT_FALSE(notified());
+    EXPECT_TRUE(with([](SsdpDevice& d) { d.account = "x"; }));
+    EXPECT_TRUE(with([](SsdpDevice& d) { d.guide = "G2"; }));
+    EXPECT_TRUE(with([](SsdpDevice& d) { d.openId = "other"; }));
+    EXPECT_TRUE(with([](SsdpDevice& d) { d.isOpenIdSame = !d.isOpenIdSame; }));
+    EXPECT_TRUE(with([](SsdpDevice& d) { d.deviceId = "00000000"; }));
+    EXPECT_TRUE(notified());
+
+    // A reporter taken off the list is not woken any more.
+    compare.removeObserver(reporter);
+    hear(phone("wxyz"), "10.0.0.2");
+    EXPECT_FALSE(notified());
+    EXPECT_TRUE(pcsuite.requestsTo(kLanPath).empty());
+}
+
+TEST_F(DeviceReportsTest, BurstGoesAsOneListAndTheThrottleHoldsTheNext) {
+    env.config().reportDelay = 300ms;
+    env.config().reportThrottle = 1h;
+    WlanDetectedDeviceCompare compare(table);
+    auto reporter = std::make_shared<WlanReportDevices>(table);
+    compare.addObserver(reporter);
+
+    hear(phone("bbbb"), "10.0.0.2");
+    hear(phone("aaaa"), "10.0.0.1");
+    ASSERT_TRUE(reports(1, 10s)) << seen(pcsuite);
+    const auto first = pcsuite.requestsTo(kLanPath).at(0);
+    EXPECT_EQ(first.method, "POST");
+    EXPECT_EQ(first.path, kLanPath);
+    EXPECT_EQ(first.body, "[" + element("61616161", "10.0.0.1") + ", " + element("62626262", "10.0.0.2") + "]");
+
+    // The next change waits for the throttle; stop() ends that wait and nothing goes.
+    hear(phone("cccc"), "10.0.0.3");
+    EXPECT_FALSE(reports(2, 500ms)) << seen(pcsuite);
+    reporter->stop();
+    compare.notifySubscribers();  // a stopped reporter ignores notifications
+    EXPECT_FALSE(reports(2, 200ms)) << seen(pcsuite);
+    EXPECT_EQ(pcsuite.requestsTo(kLanPath).size(), 1u);
+}
+
+TEST_F(DeviceReportsTest, ChangeWhileAListIsPostedGetsAFollowUp) {
+    env.config().reportThrottle = 200ms;
+    pcsuite.queueAnswer(kLanPath, {200, R"({"code":"000000"})", "application/json", 700ms});
+    WlanDetectedDeviceCompare compare(table);
+    auto reporter = std::make_shared<WlanReportDevices>(table);
+    compare.addObserver(reporter);
+
+    hear(phone("aaaa"), "10.0.0.1");
+    ASSERT_TRUE(reports(1, 10s)) << seen(pcsuite);  // its answer is still held back
+    hear(phone("bbbb"), "10.0.0.2");
+    hear(phone("bbbb", "139****1111"), "10.0.0.2");
+    ASSERT_TRUE(reports(2, 10s)) << seen(pcsuite);
+    EXPECT_FALSE(reports(3, 600ms)) << seen(pcsuite);  // one follow-up, not one per change
+    const auto requests = pcsuite.requestsTo(kLanPath);
+    ASSERT_EQ(requests.size(), 2u);
+    EXPECT_EQ(requests[0].body, "[" + element("61616161", "10.0.0.1") + "]");
+    EXPECT_EQ(requests[1].body, "[" + element("61616161", "10.0.0.1") + ", " +
+                                    element("62626262", "10.0.0.2", "139****111") + "]");
+}
+
+TEST_F(DeviceReportsTest, NetworkAndApplicationTests) {
+    env.config().reportThrottle = 0ms;
+    WlanReportDevices lan(table);
+    hear(phone("aaaa"), "10.0.0.1");
+    const std::string url = pcsuite.baseUrl() + "SSDPQueryAll";
+    const std::string useless = "[WlanReportDevices::sendDevices] Network is useless, don't send wlan devices";
+
+    // No Ethernet adapter and Wi-Fi off: nothing posted, one log line.
+    fake->setNetworkServices({{"Wi-Fi", "wlan0", "aa:bb:cc:dd:ee:02"}});
+    EXPECT_FALSE(lan.send(url));
+    EXPECT_TRUE(pcsuite.requestsTo(kLanPath).empty());
+    EXPECT_NE(todaysLog().find(useless), std::string::npos);
+
+    // Wi-Fi switched on is enough; so is an Ethernet adapter, even without an address.
+    fake->setWifiPowerOn(true);
+    EXPECT_TRUE(lan.send(url));
+    fake->setWifiPowerOn(false);
+    fake->setNetworkServices({{"Ethernet", "eth1", "aa:bb:cc:dd:ee:03"}});
+    EXPECT_TRUE(lan.send(url));
+    EXPECT_EQ(pcsuite.requestsTo(kLanPath).size(), 2u);
+
+    // The application test: exactly two of the PC suite's processes read as "not running".
+    const std::string app = DeviceListReporter::pcsuiteAppName;
+    DeviceWaitForPreConnectManager registry;
+    ReportDevicesV2 preconnect(registry);
+    fake->setRunningApplicationNames({app, "bash", app});
+    EXPECT_FALSE(lan.send(url));
+    EXPECT_FALSE(preconnect.send(pcsuite.baseUrl() + "RH2RF_PUSH_GATT_CLIENT_LIST"));
+    EXPECT_EQ(pcsuite.requestsTo(kLanPath).size(), 2u);
+    EXPECT_TRUE(pcsuite.requestsTo(kPreconnectPath).empty());
+    fake->setRunningApplicationNames({app});
+    EXPECT_TRUE(lan.send(url));
+    EXPECT_EQ(pcsuite.requestsTo(kLanPath).size(), 3u);
+
+    // The pre-connect list has no network test.
+    fake->setNetworkServices({});
+    EXPECT_TRUE(preconnect.send(pcsuite.baseUrl() + "RH2RF_PUSH_GATT_CLIENT_LIST"));
+    EXPECT_FALSE(lan.send(url));
+    EXPECT_EQ(pcsuite.requestsTo(kLanPath).size(), 3u);
+    const auto preconnectLists = pcsuite.requestsTo(kPreconnectPath);
+    ASSERT_EQ(preconnectLists.size(), 1u);
+    EXPECT_EQ(preconnectLists[0].method, "POST");
+    EXPECT_EQ(preconnectLists[0].body, "[]");
+
+    // No PC suite listening: the post fails and the reporter is idle again.
+    pcsuite.stop();
+    fake->setNetworkServices({{"Ethernet", "eth1", "aa:bb:cc:dd:ee:03"}});
+    EXPECT_FALSE(lan.send(url));
+    EXPECT_FALSE(lan.getIsNotify());
+    EXPECT_NE(todaysLog().find("[Utils::httpMsgSend] httpMsgSend but no response return"), std::string::npos);
+}
+
+TEST_F(DeviceReportsTest, PreconnectListPostsEveryEntry) {
+    DeviceWaitForPreConnectManager registry;
+    ReportDevicesV2 reporter(registry);
+    const Json one{{"id", "a1"}, {"deviceName", "X1"}, {"isConnected", true}, {"rssi", -99}};
+    const Json two{{"id", "b2"}, {"deviceName", "Tab"}, {"isConnected", false}, {"inets", Json::array()}};
+    registry.addDevices("6131", std::make_shared<ListedEntry>(one));
+    registry.addDevices("6232", std::make_shared<ListedEntry>(two));
+
+    reporter.notify();
+    reporter.notify();
+    ASSERT_TRUE(reports(1, 10s, kPreconnectPath)) << seen(pcsuite);
+    ASSERT_TRUE(reporter.waitIdle(10s));
+    const auto request = pcsuite.requestsTo(kPreconnectPath).at(0);
+    EXPECT_EQ(request.method, "POST");
+    EXPECT_EQ(request.path, kPreconnectPath);
+    const std::string body = R"([{"deviceName":"X1","id":"a1","isConnected":true,"rssi":-99}, )"
+                             R"({"deviceName":"Tab","id":"b2","inets":[],"isConnected":false}])";
+    EXPECT_EQ(request.body, body);
+    EXPECT_NE(todaysLog().find("[ReportDevicesV2::sendDevices] [INTERACTION][CONNSERVER_TO_PCSUITE] "
+                               "SendDevices content: " + body),
+              std::string::npos);
+
+    // An emptied registry gives the empty list (after the throttle).
+    registry.clearAllDevices();
+    reporter.notify();
+    ASSERT_TRUE(reports(2, 10s, kPreconnectPath)) << seen(pcsuite);
+    EXPECT_EQ(pcsuite.requestsTo(kPreconnectPath).at(1).body, "[]");
+}
+
+TEST_F(DeviceReportsTest, ReannouncedDeviceIsReportedOnceThenOnceMoreWhenItExpires) {
+    WlanDetectedDeviceCompare compare(table);
+    WlanDeviceDelete expiry(table);
+    auto reporter = std::make_shared<WlanReportDevices>(table);
+    compare.addObserver(reporter);
+    expiry.addObserver(reporter);
+    expiry.detectedToDelete(env.config().expirySweepPeriod);
+
+    hear(phone("aaaa"), "10.0.0.1");
+    ASSERT_TRUE(reports(1, 10s)) << seen(pcsuite);
+    for (int i = 0; i < 5; ++i) {  // the sweep runs meanwhile: every 5 s keeps it listed
+        advance(5);
+        hear(phone("aaaa"), "10.0.0.1");
+    }
+    EXPECT_FALSE(reports(2, 400ms)) << seen(pcsuite);
+
+    // Silent for more than 30 s: the sweep removes it and the empty list goes.
+    advance(30.5);
+    ASSERT_TRUE(reports(2, 10s)) << seen(pcsuite);
+    const auto requests = pcsuite.requestsTo(kLanPath);
+    ASSERT_EQ(requests.size(), 2u);
+    EXPECT_EQ(requests[0].body, "[" + element("61616161", "10.0.0.1") + "]");
+    EXPECT_EQ(requests[1].body, "[]");
+    EXPECT_EQ(table.ssdpDeviceMap.size(), 0u);
+    EXPECT_NE(todaysLog().find("[eraseTimeOut]: erase ssdpdevice: X1 Pro, 61616161"), std::string::npos);
+
+    // Sweeps that remove nothing send nothing; a stopped loop sweeps no more.
+    EXPECT_FALSE(reports(3, 300ms)) << seen(pcsuite);
+    expiry.stop();
+    hear(phone("bbbb"), "10.0.0.2");
+    ASSERT_TRUE(reports(3, 10s)) << seen(pcsuite);
+    advance(60);
+    EXPECT_FALSE(reports(4, 300ms)) << seen(pcsuite);
+    EXPECT_EQ(table.ssdpDeviceMap.size(), 1u);
+}
+
+// The service manager's wiring: a first LAN list at start, one per new device heard through
+// the process-wide table, one on the control request startSSDPScan, none after stop().
+TEST_F(DeviceReportsTest, ServiceStartWiresTheLanReports) {
+    env.config().phoneTcpPort = test::freeTcpPort();
+    env.config().ssdpPort = test::freeTcpPort();
+    SsdpDeviceManager& global = SsdpDeviceManager::instance();
+    global.ssdpDeviceMap.eraseTimeOut(1e300);
+
+    ServiceManager manager;
+    manager.start();
+    ASSERT_TRUE(waitForPath(pcsuite, kLanPath, 1, 10s));
+    EXPECT_EQ(pcsuite.requestsTo(kLanPath).at(0).body, "[]");
+
+    SsdpMessage::insertResponseDevice(json::compact(phone("aaaa")), "10.0.0.1", "openid-of-this-pc", true);
+    ASSERT_TRUE(waitForPath(pcsuite, kLanPath, 2, 10s));
+    EXPECT_EQ(pcsuite.requestsTo(kLanPath).at(1).body, "[" + element("61616161", "10.0.0.1") + "]");
+
+    const std::string answer = HttpService::handleBody(R"({"event":"startSSDPScan","args":[]})");
+    EXPECT_NE(answer.find(R"("error": 0)"), std::string::npos) << answer;
+    ASSERT_TRUE(waitForPath(pcsuite, kLanPath, 3, 10s));
+    EXPECT_EQ(pcsuite.requestsTo(kLanPath).at(2).body, "[" + element("61616161", "10.0.0.1") + "]");
+
+    manager.stop();
+    WlanDetectedDeviceCompare::instance().notifySubscribers();
+    SsdpMessage::insertResponseDevice(json::compact(phone("bbbb")), "10.0.0.2", "openid-of-this-pc", true);
+    EXPECT_FALSE(waitForPath(pcsuite, kLanPath, 4, 300ms));
+    global.ssdpDeviceMap.eraseTimeOut(1e300);
+}
+
+}  // namespace
+}  // namespace kesu
