@@ -1,34 +1,174 @@
 #include "connect/Pcuitinterface.h"
 
 #include "connect/ConnectCodes.h"
+#include "connect/ConnectMessage.h"
+#include "connect/SocketClient.h"
 #include "connect/Step.h"
+#include "core/Config.h"
 #include "core/Json.h"
 #include "core/Utils.h"
+#include "discovery/SsdpDeviceManager.h"
 
 namespace kesu {
 
-std::atomic<bool>& SSDPcancel() {
-    static std::atomic<bool> flag{false};
-    return flag;
+CancelFlag& CancelFlag::operator=(bool cancel) {
+    std::shared_ptr<SocketClient> running;
+    {
+        std::lock_guard<std::mutex> lock(mutex_);
+        flag_.store(cancel);
+        if (cancel) running = running_;
+    }
+    // Shutting the link wakes the attempt wherever it waits (connect, send or answer).
+    if (running) running->disConnectServer();
+    return *this;
 }
 
-std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
+bool CancelFlag::attach(std::shared_ptr<SocketClient> client) {
+    std::lock_guard<std::mutex> lock(mutex_);
+    running_ = std::move(client);
+    return flag_.load();
+}
+
+void CancelFlag::detach() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    running_.reset();
+}
+
+CancelFlag& SSDPcancel() {
+    static auto* flag = new CancelFlag();
+    return *flag;
+}
+
+namespace {
+
+// Held for the whole of one attempt.
+std::mutex& attemptMutex() {
+    static auto* mutex = new std::mutex();
+    return *mutex;
+}
+
+std::string busyReply() {
     const Step& step = sharedStep();
+    return json::compact(Json{{"error", rawValue(ErrorCode::STATE_BUSY)},
+                              {"error_message", "STATE_BUSY"},
+                              {"connection_steps", step.getConnectCode(step.WLAN_GET_CONNECT_STATE) +
+                                                       step.getConnectResult(step.WLAN_GET_CONNECT_STATE,
+                                                                             Result::FAILED)}});
+}
+
+}  // namespace
+
+std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
+    std::unique_lock<std::mutex> oneAttempt(attemptMutex(), std::try_to_lock);
+    if (!oneAttempt.owns_lock()) {
+        Utils::mPrintlog("[ActiveConnect] another connection is in progress, " + stringId + " is answered busy \n");
+        return busyReply();
+    }
+
+    const Step& step = sharedStep();
+    const Config& config = Config::current();
     Utils::setWlanConnState(false);
     SSDPcancel() = false;
+    const auto deadline = SocketClient::Clock::now() + config.activeConnectTimeout;
     Json reply = {{"error", 0}, {"error_message", ""}, {"connection_steps", ""}};
     std::string steps = step.getConnectCode(step.WLAN_GET_CONNECT_STATE) +
                         step.getConnectResult(step.WLAN_GET_CONNECT_STATE, Result::OK) +
                         step.getConnectCode(step.WLAN_FIND_DEVICES);
-    // Phones are connected once LAN discovery fills the device table; until then no id is
-    // known.
-    const std::string text = "[ActiveConnect] address_ " + stringId + " find ssdp device error not find";
-    Utils::mPrintlog("[ActiveConnect] Error occur as: " + text + "\n");
-    reply["error"] = rawValue(ErrorCode::NOT_FOUND);
-    reply["errir_message"] = text;
-    steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::FAILED);
-    reply["connection_steps"] = steps;
-    return json::compact(reply);
+    auto finish = [&](int error, const std::string& key, const std::string& message) {
+        reply["error"] = error;
+        reply[key] = message;
+        reply["connection_steps"] = steps;
+        return json::compact(reply);
+    };
+
+    SsdpDevicePtr device;
+    if (!SsdpDeviceManager::instance().ssdpDeviceMap.lookup(stringId, device) || !device) {
+        const std::string text = "[ActiveConnect] address_ " + stringId + " find ssdp device error not find";
+        Utils::mPrintlog("[ActiveConnect] Error occur as: " + text + "\n");
+        steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::FAILED);
+        return finish(rawValue(ErrorCode::NOT_FOUND), "errir_message", text);
+    }
+    if (device->ip.empty() || device->ip.front().empty()) {
+        // Known from an announcement that carried no usable sender address: nothing to dial.
+        const std::string text = "[ActiveConnect] address_ " + stringId + " ssdp device has no address";
+        Utils::mPrintlog("[ActiveConnect] Error occur as: " + text + "\n");
+        steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::FAILED);
+        return finish(rawValue(ErrorCode::NOT_FOUND), "error_message", text);
+    }
+    Utils::setConnectingDeviceType(device->deviceType);
+
+    // The attempt's link is reachable by a cancel request until the attempt returns.
+    struct AttachGuard {
+        ~AttachGuard() { SSDPcancel().detach(); }
+    };
+    ClientWorkAct work;
+    AttachGuard attached;
+    if (SSDPcancel().attach(work.ClientShared)) {
+        Utils::mPrintlog("[ActiveConnect] cancel before initTcp \n");
+        steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::CANCEL);
+        return finish(rawValue(ErrorCode::CANCEL), "errir_message", "CANCEL");
+    }
+    steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::OK) + step.getConnectCode(step.WLAN_CONNECT_SERVER);
+
+    const std::string& ip = device->ip.front();
+    Utils::mPrintlog("[ActiveConnect] Enter the accept event waiting! \n");
+    const auto outcome = work.ClientReqServer(static_cast<std::uint16_t>(config.phoneTcpPort), ip, deadline,
+                                              [] { return SSDPcancel().load(); });
+    const bool cancelled = SSDPcancel().load();
+    Utils::mPrintlog(outcome == ClientWorkAct::Outcome::Answered || cancelled
+                         ? "[ActiveConnect]accept event success \n"
+                         : "[ActiveConnect]accept event timedOut \n");
+    Utils::mPrintlog("[ActiveConnect] Leave the accept event waiting! \n");
+
+    if (outcome == ClientWorkAct::Outcome::ConnectFailed && !cancelled) {
+        // The phone's port could not be reached: no answer can come, and the connect step
+        // is reported as failed.
+        work.ClientDisConnServer();
+        steps += step.getConnectResult(step.WLAN_CONNECT_SERVER, Result::FAILED);
+        Utils::mPrintlog("[ActiveConnect] return_code_ " + std::to_string(rawValue(ConnectTag::TIMEOUT)) +
+                         " , timeout \n");
+        return finish(rawValue(ErrorCode::TIMEOUT), "error_message",
+                      "[SSDP search] connect timeout or phone wake up pcsuite failed.");
+    }
+    steps += step.getConnectResult(step.WLAN_CONNECT_SERVER, Result::OK) + step.getConnectCode(step.WLAN_RECV_RESPONSE);
+
+    if (cancelled) {
+        Utils::mPrintlog("[ActiveConnect] cancel before return code \n");
+        work.ClientDisConnServer();
+        steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::CANCEL);
+        return finish(rawValue(ErrorCode::CANCEL), "errir_message", "CANCEL");
+    }
+
+    const std::string text = work.ClientShared->ServerMessageReceive();
+    Utils::mPrintlog("[TCP Positive Conn] " + text);
+    const ConnectTag answer = classifyPhoneAnswer(text);
+    const std::string code = std::to_string(rawValue(answer));
+    work.ClientDisConnServer();
+
+    switch (answer) {
+    case ConnectTag::PHONEAGREE:
+        Utils::mPrintlog("[ActiveConnect] phone is accepted the request, phone ip is : " + describeList(device->ip));
+        steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::OK);
+        reply["data"] = ip;
+        {
+            const std::string result = finish(0, "error_message", "");
+            Utils::mPrintlog("connect success : " + result);
+            return result;
+        }
+    case ConnectTag::BUSY:
+        Utils::mPrintlog("[ActiveConnect] return_code_ " + code + " , phone is busy \n");
+        steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::BUSY);
+        return finish(rawValue(ErrorCode::STATE_BUSY), "error_message", "[SSDP search] phone is busy.");
+    case ConnectTag::PHONEREJECT:
+        Utils::mPrintlog("[ActiveConnect] return_code_ " + code + " \n");
+        steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::REJECT);
+        return finish(rawValue(ErrorCode::REJECT), "error_message", "[SSDP search] phone reject the connect.");
+    default:
+        Utils::mPrintlog("[ActiveConnect] return_code_ " + code + " , timeout \n");
+        steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::TIMEOUT);
+        return finish(rawValue(ErrorCode::TIMEOUT), "error_message",
+                      "[SSDP search] connect timeout or phone wake up pcsuite failed.");
+    }
 }
 
 }  // namespace kesu

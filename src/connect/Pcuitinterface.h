@@ -1,17 +1,43 @@
-// The PC-initiated connection to a discovered phone.
+// The PC-initiated connection to a discovered phone, and the cancel request that ends it.
 #pragma once
 
 #include <atomic>
+#include <memory>
+#include <mutex>
 #include <string>
 
 namespace kesu {
 
-// Cancel request for the running PC-initiated connection.
-std::atomic<bool>& SSDPcancel();
+class SocketClient;
+
+// The cancel request of the running PC-initiated connection. Setting it to true also ends
+// the running attempt's wait at once (its link is shut); the attempt then answers as
+// cancelled. An attempt sets it back to false when it starts.
+class CancelFlag {
+public:
+    CancelFlag& operator=(bool cancel);
+    bool load() const { return flag_.load(); }
+    explicit operator bool() const { return load(); }
+
+private:
+    friend class Pcuitinterface;
+    // Makes `client` the running attempt's link; returns the flag as it is now.
+    bool attach(std::shared_ptr<SocketClient> client);
+    void detach();
+
+    std::atomic<bool> flag_{false};
+    std::mutex mutex_;
+    std::shared_ptr<SocketClient> running_;
+};
+
+CancelFlag& SSDPcancel();
 
 class Pcuitinterface {
 public:
-    // The whole attempt; returns the compact connection reply.
+    // The whole attempt; returns the compact connection reply {"error", "error_message",
+    // "connection_steps"(, "data")(, "errir_message")}. Blocks until the phone answered, the
+    // attempt failed or was cancelled, or Config::activeConnectTimeout passed. One attempt
+    // runs at a time: a call while another runs gets the busy reply.
     std::string ActiveConnect(const std::string& stringId);
 };
 

@@ -1,0 +1,242 @@
+#include "connect/LaunchService.h"
+
+#include "account/DataInstance.h"
+#include "connect/AllowWindow.h"
+#include "core/Config.h"
+#include "core/Json.h"
+#include "core/Utils.h"
+#include "pcsuite/BuryPoint.h"
+#include "pcsuite/RequestBase.h"
+
+namespace kesu {
+
+namespace {
+
+const std::string kConnectionMode = "WLAN";
+
+std::string accountOpenId() { return dataInstance().get(&databaseParam::openid); }
+
+// "http://ip:port" for an address literal (IPv6 in brackets).
+std::string httpUrl(const std::string& host, int port) {
+    const std::string literal = host.find(':') != std::string::npos ? "[" + host + "]" : host;
+    return "http://" + literal + ":" + std::to_string(port);
+}
+
+}  // namespace
+
+std::vector<std::string> LaunchService::allowWindowArguments(AppSource appSource, const std::string& deviceName,
+                                                             const std::string& deviceId, const std::string& account,
+                                                             const std::string& sameAccount,
+                                                             const std::string& deviceType) {
+    return {std::to_string(rawValue(appSource)), deviceName, deviceId, account, sameAccount, deviceType};
+}
+
+std::vector<std::string> LaunchService::pcSuiteArguments(const std::string& ip, const std::string& deviceName,
+                                                         long long seqNo, const std::string& connectionMode,
+                                                         const std::string& deviceId, bool autoConnect,
+                                                         const std::string& account, const std::string& deviceType,
+                                                         const std::string& sameAccount) {
+    return {"--h=" + ip,
+            "--n=\"" + deviceName + "\"",
+            "--seq=" + std::to_string(seqNo),
+            "--m=" + connectionMode,
+            "--i=" + deviceId,
+            std::string("--a=") + (autoConnect ? "true" : "false"),
+            "--account=" + account,
+            "--dt=" + deviceType,
+            "--as=" + sameAccount};
+}
+
+void LaunchService::launchService(const std::string& ip, const std::string& localIp, AppSource appSource,
+                                  const PhoneConnectRequest& request, const SendTcp& sendTcp) {
+    Utils::mPrintlog("[launchService] mac receive LAN connection \n");
+    const bool forPcsuite = appSource == AppSource::pcsuite;
+    if (forPcsuite) {
+        // The answer of this request's allow window starts unknown. (A sharing request has no
+        // window and leaves a running PC suite request's answer alone.)
+        Utils::setIsAllowWindow(false);
+        Utils::setThisPhoneAutoConnect(false);
+
+        std::string respondDeviceType;
+        std::string connectStatus;
+        if (!Utils::isDeviceConnectable(request.deviceType, respondDeviceType, connectStatus)) {
+            if (respondDeviceType == request.deviceType) {
+                Utils::mPrintlog("[launchService] PC has connected other device, same deviceType busy!\n");
+                sendTcp(ConnectTag::BUSY, serviceId::pcsuiteId);
+            } else {
+                Utils::mPrintlog("[launchService] PC has connected other device, different deviceType busy!\n");
+                sendTcp(ConnectTag::DIFFDEVICEBUSY, serviceId::pcsuiteId);
+                Utils::mPrintlog("[launchService] Final finished\n");
+            }
+            return;
+        }
+    }
+
+    const BuryPoint::Record record = BuryPoint::listRecord("W688|10159", Json::object(), Json{{"finish", 1}});
+    const std::string buryPointStr = BuryPoint::listText(record, true);
+    Utils::mPrintlog("[launchService] sendBuryPoint buryPointStr is: " + buryPointStr);
+    if (Utils::sendBuryPoint(buryPointStr)) Utils::mPrintlog("[launchService] sendBuryPoint success \n");
+
+    const int exitCode = startAllowedWindow(appSource, request.deviceName, request.deviceId, request.account,
+                                            request.openId, request.deviceType);
+    Utils::mPrintlog("[launchService] startAllowedWindow exitCode is " + std::to_string(exitCode));
+    if (exitCode != 0) Utils::mPrintlog("[launchService] reject for exitCode " + std::to_string(exitCode));
+
+    const long long seqNo = Utils::getNfcLanConnectSeqNo();
+    if (forPcsuite) {
+        Utils::mPrintlog("[launchService] launch service is pcsuite \n");
+        if (exitCode != 0 || !Utils::getIsAllowWindow()) {
+            Utils::mPrintlog("[launchService] send tcp reject data to phone \n");
+            sendTcp(ConnectTag::REJECT, serviceId::pcsuiteId);
+            return;
+        }
+        Utils::mPrintlog("[launchService] send tcp agree data to phone \n");
+        sendTcp(ConnectTag::AGREE, serviceId::pcsuiteId);
+
+        const bool autoConnect = Utils::getThisPhoneAutoConnect();
+        if (sendPhoneInfoToPcsuite(localIp, ip, request.deviceName, kConnectionMode, request.deviceId, seqNo,
+                                   autoConnect, request.account, request.deviceType, request.openId)) {
+            Utils::mPrintlog(
+                "[launchService] success to send phone info to pcsuite, by http request(9199), phone ip is: " + ip);
+        } else {
+            Utils::mPrintlog(
+                "[launchService] failed to send phone info to pcsuite by http request(9199), start pcsuite.exe \n");
+            startPcSuite(ip, request.deviceName, seqNo, kConnectionMode, request.deviceId, autoConnect,
+                         request.account, request.openId, request.deviceType);
+        }
+    } else {
+        Utils::mPrintlog("[launchService] launch service is kesushare \n");
+        Utils::mPrintlog("[launchService] send tcp agree data to phone \n");
+        sendTcp(ConnectTag::AGREE, serviceId::shareId);
+        Utils::mPrintlog("[launchService] start to launch kesu share allowed window \n");
+        startKesuShareAllowedWindow(request.deviceName, request.deviceId, ip, request.openId, seqNo, request.port);
+    }
+    Utils::mPrintlog(
+        "[launchService] waiting for pcsuite/kesushare connecting websocket result by [reportNFCConnectResult] \n");
+}
+
+int LaunchService::startAllowedWindow(AppSource appSource, const std::string& deviceName, const std::string& deviceId,
+                                      const std::string& account, const std::string& openId,
+                                      const std::string& deviceType) {
+    if (appSource == AppSource::kesuShare) return 0;
+    const Config& config = Config::current();
+    const std::string path = rootedPath(config.connectStatusExecutable);
+    const auto arguments = allowWindowArguments(appSource, deviceName, deviceId, account,
+                                                sameAccountFlag(openId, accountOpenId()), deviceType);
+
+    // Answers left over from an earlier window do not count for this one.
+    while (hAllowSemaphore().try_acquire()) {
+    }
+    {
+        std::lock_guard<std::mutex> lock(waitMutex_);
+        if (stopped_) return -1;
+        ++waiting_;  // from here on stopWaits() ends this wait
+    }
+    Utils::mPrintlog("[startAllowedWindow] launchPath is: " + path + ", arguments is: " + describeList(arguments) +
+                     " \n");
+    int exitCode = 0;
+    const bool started = Utils::startProcess(path, arguments, exitCode);
+    Utils::mPrintlog("[startAllowedWindow] exitCode is: " + std::to_string(exitCode) + "\n");
+    if (!started) {
+        std::lock_guard<std::mutex> lock(waitMutex_);
+        --waiting_;
+        return -1;
+    }
+    Utils::mPrintlog("[startAllowedWindow] Enter the allow window event waiting! \n");
+    const bool answered = hAllowSemaphore().try_acquire_for(config.allowWindowTimeout);
+    bool stopped = false;
+    {
+        std::lock_guard<std::mutex> lock(waitMutex_);
+        --waiting_;
+        stopped = stopped_;
+    }
+    Utils::mPrintlog(answered ? "[startAllowedWindow]allow window event success \n"
+                              : "[startAllowedWindow]allow window event timedOut \n");
+    Utils::mPrintlog("[startAllowedWindow] Leave the allow window event waiting! \n");
+
+    if (!stopped && Utils::getIsAllowWindow()) {
+        Utils::mPrintlog("[startAllowedWindow] you have agree the allowed window! \n");
+        return 0;
+    }
+    Utils::mPrintlog("[startAllowedWindow] you have refuse the allowed window! \n");
+    return -1;
+}
+
+bool LaunchService::sendPhoneInfoToPcsuite(const std::string& localIp, const std::string& ip,
+                                           const std::string& deviceName, const std::string& connectionMode,
+                                           const std::string& deviceId, long long seqNo, bool autoConnect,
+                                           const std::string& account, const std::string& deviceType,
+                                           const std::string& openId) {
+    const Json args = Json::array({ip, deviceName, connectionMode, deviceId, std::to_string(seqNo),
+                                   autoConnect ? "true" : "false", account, deviceType,
+                                   sameAccountFlag(openId, accountOpenId())});
+    const Json jsonPostHttp = {{"event", "nfcConection"}, {"args", args}};
+    // The PC suite has always been sent the byte count of the pretty-printed text in front of
+    // the compact text.
+    const std::string PosStr = std::to_string(json::pretty(jsonPostHttp).size()) + "#" + json::compact(jsonPostHttp);
+    Utils::mPrintlog("[SocketServer::sendPhoneInfoToPcsuite] PosStr to pcsuite is: " + PosStr);
+    if (localIp.empty()) return false;
+    return RequestBase::urlSessionPost(PosStr, httpUrl(localIp, Config::current().pcsuitePort));
+}
+
+bool LaunchService::startPcSuite(const std::string& ip, const std::string& deviceName, long long seqNo,
+                                 const std::string& connectionMode, const std::string& deviceId, bool autoConnect,
+                                 const std::string& account, const std::string& openId,
+                                 const std::string& deviceType) {
+    const std::string path = rootedPath(Config::current().pcsuiteExecutable);
+    const auto arguments = pcSuiteArguments(ip, deviceName, seqNo, connectionMode, deviceId, autoConnect, account,
+                                            deviceType, sameAccountFlag(openId, accountOpenId()));
+    Utils::mPrintlog("[startPcSuite] launchPath is: " + path + ", arguments is: " + describeList(arguments) + " \n");
+    int exitCode = 0;
+    if (!Utils::startProcess(path, arguments, exitCode)) {
+        Utils::mPrintlog("[startPcSuite] exitCode is: " + std::to_string(exitCode) + "\n");
+        Utils::mPrintlog("[startPcSuite] start pcsuite failed \n");
+        return false;
+    }
+    return true;
+}
+
+std::pair<std::string, std::string> LaunchService::receiveFolders() {
+    const std::string accountFolder = dataInstance().get(&databaseParam::storageDir);
+    std::lock_guard<std::mutex> lock(folderMutex_);
+    if (!folderKnown_) {
+        folderKnown_ = true;
+        currentFolder_ = previousFolder_ = accountFolder;
+    } else if (accountFolder != currentFolder_) {
+        previousFolder_ = currentFolder_;
+        currentFolder_ = accountFolder;
+    }
+    const std::string fallback = rootedPath(Config::current().shareReceiveFolder);
+    return {currentFolder_.empty() ? fallback : currentFolder_, previousFolder_.empty() ? fallback : previousFolder_};
+}
+
+bool LaunchService::startKesuShareAllowedWindow(const std::string& deviceName, const std::string& deviceId,
+                                                const std::string& ip, const std::string& openId, long long seqNo,
+                                                const std::string& port) {
+    const std::string address = port.empty() ? ip : ip + ":" + port;
+    const auto [current, previous] = receiveFolders();
+    const std::string path = rootedPath(Config::current().connectStatusExecutable);
+    const std::vector<std::string> arguments = {"2",     deviceName, deviceId, address, sameAccountFlag(openId, accountOpenId()),
+                                                current, std::to_string(seqNo), previous};
+    Utils::mPrintlog("[startKesuShareAllowedWindow] launchPath is: " + path +
+                     ", arguments is: " + describeList(arguments) + " \n");
+    int exitCode = 0;
+    const bool started = Utils::startProcess(path, arguments, exitCode);
+    Utils::mPrintlog("[startKesuShareAllowedWindow] exitCode is: " + std::to_string(exitCode) + "\n");
+    Utils::mPrintlog(started ? "[startKesuShareAllowedWindow] kesushare allowedWindow open success! \n"
+                             : "[startKesuShareAllowedWindow] kesushare allowedWindow open failed! \n");
+    return started;
+}
+
+void LaunchService::stopWaits() {
+    std::lock_guard<std::mutex> lock(waitMutex_);
+    stopped_ = true;
+    if (waiting_ > 0) hAllowSemaphore().release(waiting_);
+}
+
+void LaunchService::resume() {
+    std::lock_guard<std::mutex> lock(waitMutex_);
+    stopped_ = false;
+}
+
+}  // namespace kesu

@@ -1,0 +1,103 @@
+#include "connect/SocketClient.h"
+
+#include "connect/ConnectMessage.h"
+#include "connect/PhoneFrame.h"
+#include "core/Json.h"
+#include "core/Utils.h"
+
+namespace kesu {
+
+bool SocketClient::connect(std::uint16_t ConnectServerPort, const std::string& host, Clock::time_point deadline) {
+    std::string error;
+    if (!link_.connect(host, ConnectServerPort, deadline, error)) {
+        Utils::mPrintlog("[TCP Positive Conn]Error occur during connect as: " + error);
+        return false;
+    }
+    Utils::mPrintlog("[TCP Positive Conn] success, host: " + link_.localAddress() +
+                     ", port: " + std::to_string(link_.localPort()));
+    return true;
+}
+
+void SocketClient::disConnectServer() {
+    const bool wasConnected = link_.isConnected();
+    link_.shut();
+    if (wasConnected) Utils::mPrintlog("[TCP Positive Conn] An unknown error, Execute down! disconenct now \n");
+}
+
+bool SocketClient::C2SsendMessage(const Bytes& message, Clock::time_point deadline) {
+    std::string error;
+    if (!link_.writeAll(message, deadline, error)) {
+        Utils::mPrintlog("[TCP Positive Conn] An error, Execute down! error code: " + error + ", disconenct now \n");
+        return false;
+    }
+    Utils::mPrintlog("[TCP Positive Conn] Client write tag 0 done \n");
+    return true;
+}
+
+bool SocketClient::CFrSpullMessage(Clock::time_point deadline) {
+    Bytes frame;
+    switch (link_.readFrame(frame, deadline)) {
+    case PhoneLink::Read::Frame:
+        break;
+    case PhoneLink::Read::Closed:
+        Utils::mPrintlog("[TCP Positive Conn] An error, Execute down! error code: closed by the phone, disconenct now \n");
+        return false;
+    case PhoneLink::Read::TimedOut:
+    case PhoneLink::Read::Shut:
+        return false;
+    }
+    Utils::mPrintlog("[TCP Positive Conn] Client read tag 0 done \n");
+    const auto text = phoneAnswerText(frame);
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (!text) {
+        serverMessageReceive_ = "error parse";
+        Utils::mPrintlog("[TCP Positive Conn] data parser result failed \n");
+        return true;
+    }
+    serverMessageReceive_ = *text;
+    Utils::mPrintlog("[TCP Positive Conn] Receive data is: " + *text);
+    return true;
+}
+
+std::string SocketClient::ServerMessageReceive() const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return serverMessageReceive_;
+}
+
+void SocketClient::clearServerMessageReceive() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    serverMessageReceive_.clear();
+}
+
+ClientWorkAct::ClientWorkAct(std::shared_ptr<SocketClient> client) : ClientShared(std::move(client)) {}
+
+ClientWorkAct::Outcome ClientWorkAct::ClientReqServer(std::uint16_t Port, const std::string& ip,
+                                                      Clock::time_point deadline,
+                                                      const std::function<bool()>& stopRequested) {
+    auto stopped = [&] { return ClientShared->isDisconnected() || (stopRequested && stopRequested()); };
+    if (!ClientShared->connect(Port, ip, deadline)) {
+        Utils::setWlanConnState(false);
+        if (stopped()) return Outcome::Stopped;
+        Utils::mPrintlog("[ClientReqServer] connect phone tcp server failed ...");
+        return Outcome::ConnectFailed;
+    }
+    Utils::setWlanConnState(true);
+    if (stopped()) return Outcome::Stopped;
+
+    const std::string vaildJson = json::compact(connectRequestBody());
+    Utils::mPrintlog("[ClientReqServer] Send connect message to phone, vaildJson count: " +
+                     std::to_string(vaildJson.size()) + ", vaildJson: " + vaildJson + " \n");
+    const bool sent = ClientShared->C2SsendMessage(buildPhoneFrame(vaildJson), deadline);
+    if (stopped()) return Outcome::Stopped;
+    if (!sent) return Outcome::NoAnswer;
+
+    if (ClientShared->CFrSpullMessage(deadline)) return Outcome::Answered;
+    return stopped() ? Outcome::Stopped : Outcome::NoAnswer;
+}
+
+void ClientWorkAct::ClientDisConnServer() {
+    ClientShared->clearServerMessageReceive();
+    ClientShared->disConnectServer();
+}
+
+}  // namespace kesu

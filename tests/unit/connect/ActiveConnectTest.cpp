@@ -1,0 +1,216 @@
+// The PC-initiated connection against simulated phones on loopback: the request on the wire,
+// every answer, silence, hang-up, refusal, unknown and address-less devices, a cancel that
+// ends the wait, and a second request while one waits.
+#include <gtest/gtest.h>
+
+#include <future>
+
+#include "account/DataInstance.h"
+#include "connect/Pcuitinterface.h"
+#include "control/HttpService.h"
+#include "core/Utils.h"
+#include "discovery/SsdpDeviceManager.h"
+#include "platform/fake/FakePlatform.h"
+#include "support/TestSupport.h"
+#include "unit/connect/PhoneSim.h"
+
+namespace kesu {
+namespace {
+
+using namespace std::chrono_literals;
+using test::SimPhone;
+
+// Far beyond what any of these exchanges needs; a wait that ends well before it ended by its
+// event.
+constexpr auto kLong = 120s;
+constexpr auto kWellBeforeLong = 60s;
+
+class ActiveConnectTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        Utils::resetStateForTest();
+        clearTable();
+        fake->setLocalizedHostName("Office-Desk-PC");
+        fake->addAdapter("Wi-Fi", "wlan0", "aa:bb:cc:dd:ee:ff", "192.168.1.2");
+        dataInstance().update([](databaseParam& p) {
+            p = databaseParam();
+            p.openid = "openid-of-pc";
+            p.Phone = "138****5678";
+        });
+        env.config().activeConnectTimeout = kLong;
+    }
+    void TearDown() override {
+        clearTable();
+        dataInstance().update([](databaseParam& p) { p = databaseParam(); });
+        SSDPcancel() = false;
+        Utils::resetStateForTest();
+        Utils::closeLog();
+    }
+    static void clearTable() { SsdpDeviceManager::instance().ssdpDeviceMap.eraseTimeOut(1e18); }
+    static void addDevice(const std::string& id, std::vector<std::string> ip, const std::string& type = "phone") {
+        auto device = std::make_shared<SsdpDevice>();
+        device->deviceId = id;
+        device->ip = std::move(ip);
+        device->deviceType = type;
+        device->lastUpdate = Utils::currentTimeStamp();
+        SsdpDeviceManager::instance().ssdpDeviceMap.insert(id, device);
+    }
+    // A phone on loopback known to the table as "d1".
+    void usePhone(const SimPhone& phone, const std::string& type = "phone") {
+        env.config().phoneTcpPort = phone.port();
+        addDevice("d1", {"127.0.0.1"}, type);
+    }
+    static Json connect(const std::string& id) { return Json::parse(Pcuitinterface().ActiveConnect(id)); }
+    // One control request through the dispatcher; the JSON answer (null when empty).
+    static Json control(const std::string& event, Json args = Json::array()) {
+        const std::string answer = HttpService::handleBody(Json{{"event", event}, {"args", std::move(args)}}.dump());
+        if (answer.empty()) return Json();
+        return Json::parse(answer.substr(answer.find('#') + 1));
+    }
+    std::string todaysLog() const { return test::readAll(Utils::logFilePath(Utils::now())); }
+
+    test::HermeticEnv env;
+    ScopedFakePlatform fake;
+};
+
+TEST_F(ActiveConnectTest, PhoneAgreesWithTheRequestOnTheWire) {
+    SimPhone phone(SimPhone::Mode::Answer, R"({"bytes":[1],"deviceName":"phone"})");
+    usePhone(phone, "pad");
+    const Json reply = connect("d1");
+    EXPECT_EQ(reply, (Json{{"error", 0},
+                           {"error_message", ""},
+                           {"connection_steps", "_WI:0_WF:0_TF:0_WO:0"},
+                           {"data", "127.0.0.1"}}));
+
+    // The request: compact JSON with exactly these members.
+    const auto sent = phone.request(5s);
+    ASSERT_TRUE(sent);
+    const Json request = Json::parse(*sent);
+    EXPECT_EQ(*sent, request.dump());
+    EXPECT_EQ(request, (Json{{"bytes", {0}},
+                             {"deviceName", "Off****-PC"},
+                             {"channel", 0},
+                             {"id", 87654321},
+                             {"open_Id", "openid-of-pc"},
+                             {"service_id", "com.kesu.pcsuite.SERVICE"},
+                             {"target_id", "aabbccddeeff"},
+                             {"account", "138****5678"},
+                             {"type", 1}}));
+    EXPECT_TRUE(phone.pcClosed(kWellBeforeLong));  // the link is closed after the answer
+    EXPECT_EQ(Utils::getConnectingDeviceType(), "pad");
+    EXPECT_TRUE(Utils::getWlanConnState());
+
+    const std::string log = todaysLog();
+    EXPECT_NE(log.find("[ClientReqServer] Send connect message to phone, vaildJson count: " +
+                       std::to_string(sent->size()) + ", vaildJson: " + *sent),
+              std::string::npos);
+    EXPECT_NE(log.find("[ActiveConnect] phone is accepted the request, phone ip is : [\"127.0.0.1\"]"),
+              std::string::npos);
+}
+
+TEST_F(ActiveConnectTest, PhoneRefusesIsBusyOrSaysSomethingElse) {
+    struct Case {
+        std::string answer;
+        int error;
+        std::string message;
+        std::string steps;
+    };
+    const std::vector<Case> cases = {
+        {R"({"bytes":[2]})", -10004, "[SSDP search] phone reject the connect.", "_WI:0_WF:0_TF:0_WO:-3"},
+        {R"({"bytes":[11]})", -10001, "[SSDP search] phone is busy.", "_WI:0_WF:0_TF:0_WO:-2"},
+        {R"({"bytes":[23]})", -10007, "[SSDP search] connect timeout or phone wake up pcsuite failed.",
+         "_WI:0_WF:0_TF:0_WO:-1"},
+        {"{\"bytes\":[1],\"x\":\"\xff\"}", -10007, "[SSDP search] connect timeout or phone wake up pcsuite failed.",
+         "_WI:0_WF:0_TF:0_WO:-1"},  // not UTF-8: nothing to classify
+    };
+    for (const Case& c : cases) {
+        SimPhone phone(SimPhone::Mode::Answer, c.answer);
+        usePhone(phone);
+        const Json reply = connect("d1");
+        EXPECT_EQ(reply, (Json{{"error", c.error}, {"error_message", c.message}, {"connection_steps", c.steps}}))
+            << c.answer;
+        EXPECT_TRUE(phone.pcClosed(kWellBeforeLong)) << c.answer;
+    }
+}
+
+TEST_F(ActiveConnectTest, SilenceHangUpAndRefusedConnectAreTimeouts) {
+    const Json timeout = {{"error", -10007},
+                          {"error_message", "[SSDP search] connect timeout or phone wake up pcsuite failed."},
+                          {"connection_steps", "_WI:0_WF:0_TF:0_WO:-1"}};
+    {
+        env.config().activeConnectTimeout = 300ms;
+        SimPhone phone(SimPhone::Mode::Silent);
+        usePhone(phone);
+        EXPECT_EQ(connect("d1"), timeout);
+        EXPECT_TRUE(phone.pcClosed(kWellBeforeLong));
+        EXPECT_NE(todaysLog().find("[ActiveConnect]accept event timedOut"), std::string::npos);
+        env.config().activeConnectTimeout = kLong;
+    }
+    {
+        // The phone hangs up without answering: no answer can come any more.
+        SimPhone phone(SimPhone::Mode::HangUp);
+        usePhone(phone);
+        EXPECT_EQ(connect("d1"), timeout);
+    }
+    {
+        // Nothing listens on the phone's port: the connect step failed.
+        env.config().phoneTcpPort = test::freeTcpPort();
+        addDevice("d1", {"127.0.0.1"});
+        Json refused = timeout;
+        refused["connection_steps"] = "_WI:0_WF:0_TF:-1";
+        EXPECT_EQ(connect("d1"), refused);
+        EXPECT_FALSE(Utils::getWlanConnState());
+    }
+}
+
+TEST_F(ActiveConnectTest, UnknownDeviceAndDeviceWithoutAddress) {
+    EXPECT_EQ(connect("nope"), (Json{{"error", -10002},
+                                     {"error_message", ""},
+                                     {"errir_message", "[ActiveConnect] address_ nope find ssdp device error not find"},
+                                     {"connection_steps", "_WI:0_WF:-1"}}));
+    addDevice("quiet", {});
+    EXPECT_EQ(connect("quiet"), (Json{{"error", -10002},
+                                      {"error_message", "[ActiveConnect] address_ quiet ssdp device has no address"},
+                                      {"connection_steps", "_WI:0_WF:-1"}}));
+}
+
+TEST_F(ActiveConnectTest, CancelEndsTheWaitAtOnce) {
+    SimPhone phone(SimPhone::Mode::Silent);
+    usePhone(phone);
+    auto attempt = std::async(std::launch::async, [] { return connect("d1"); });
+    ASSERT_TRUE(phone.request(kWellBeforeLong));  // the attempt now waits for the answer
+    EXPECT_EQ(control("cancelSSDPConnect"), (Json{{"error", 0}, {"error_message", ""}}));
+    ASSERT_EQ(attempt.wait_for(kWellBeforeLong), std::future_status::ready);
+    EXPECT_EQ(attempt.get(), (Json{{"error", -10005},
+                                   {"error_message", ""},
+                                   {"errir_message", "CANCEL"},
+                                   {"connection_steps", "_WI:0_WF:0_TF:0_WO:-90"}}));
+    EXPECT_TRUE(phone.pcClosed(kWellBeforeLong));
+    EXPECT_NE(todaysLog().find("[ActiveConnect] cancel before return code"), std::string::npos);
+
+    // A cancel with no attempt running changes nothing for the next attempt.
+    control("cancelSSDPConnect");
+    SimPhone next(SimPhone::Mode::Answer, R"({"bytes":[1]})");
+    usePhone(next);
+    EXPECT_EQ(connect("d1")["error"], 0);
+}
+
+TEST_F(ActiveConnectTest, SecondRequestWhileOneWaitsIsBusy) {
+    SimPhone phone(SimPhone::Mode::Silent);
+    usePhone(phone);
+    auto first = std::async(std::launch::async, [] { return control("connectSSDP", {"d1"}); });
+    ASSERT_TRUE(phone.request(kWellBeforeLong));
+
+    const Json busy = {{"error", -10001}, {"error_message", "STATE_BUSY"}, {"connection_steps", "_WI:-1"}};
+    EXPECT_EQ(control("connectSSDP", {"d1"}), busy);
+    // Called directly, past the dispatcher's slot, the attempt still refuses to interleave.
+    EXPECT_EQ(connect("d1"), busy);
+
+    control("cancelSSDPConnect");
+    ASSERT_EQ(first.wait_for(kWellBeforeLong), std::future_status::ready);
+    EXPECT_EQ(first.get()["error"], -10005);
+    EXPECT_TRUE(Utils::getIsCanConnectDevice());  // the slot is free again
+}
+
+}  // namespace
+}  // namespace kesu

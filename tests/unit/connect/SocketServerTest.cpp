@@ -1,0 +1,323 @@
+// The server for phone-initiated connections with real loopback links: test phones send
+// request frames, the allow window and the PC suite program are scripts that report their
+// arguments, the user's answer comes through the control API, and the PC suite's listener
+// is a stub HTTP server.
+#include "connect/SocketServer.h"
+
+#include <gtest/gtest.h>
+
+#include <future>
+
+#include "account/DataInstance.h"
+#include "connect/AllowWindow.h"
+#include "connect/TcpSocketBase.h"
+#include "control/HttpService.h"
+#include "core/Utils.h"
+#include "platform/fake/FakePlatform.h"
+#include "support/StubPcSuite.h"
+#include "support/TestSupport.h"
+#include "unit/connect/PhoneSim.h"
+
+namespace kesu {
+namespace {
+
+using namespace std::chrono_literals;
+
+constexpr auto kLong = 120s;
+constexpr double kWait = 60.0;  // seconds a test phone waits for an answer
+
+void drainAllowAnswers() {
+    while (hAllowSemaphore().try_acquire()) {
+    }
+}
+
+class PhoneServer : public ::testing::Test {
+protected:
+    void SetUp() override {
+        Utils::resetStateForTest();
+        drainAllowAnswers();
+        fake->setLocalizedHostName("Office-Desk-PC");
+        fake->addAdapter("Wi-Fi", "wlan0", "aa:bb:cc:dd:ee:ff", "192.168.1.2");
+        dataInstance().update([](databaseParam& p) {
+            p = databaseParam();
+            p.openid = "openid-of-pc";
+            p.Phone = "138****5678";
+            p.storageDir = "/data/recv";
+        });
+        Config& config = env.config();
+        config.phoneServerHost = "127.0.0.1";
+        config.phoneServerPort = 0;
+        config.allowWindowTimeout = kLong;
+        config.phoneLinkReadTimeout = kLong;
+        config.httpWaitTimeout = 10s;
+        pcsuite.pointPcsuiteHere(config);
+        window = std::make_unique<test::LaunchRecorder>(rootedPath(config.connectStatusExecutable));
+        pcsuiteProgram = std::make_unique<test::LaunchRecorder>(rootedPath(config.pcsuiteExecutable));
+    }
+    // Starts the server once the test has set its configuration (its threads read it).
+    void startServer() {
+        if (server.port() > 0) return;
+        ASSERT_TRUE(ServerWorkAct(server).ServerAccept());
+        ASSERT_GT(server.port(), 0);
+    }
+    void TearDown() override {
+        server.stop();
+        drainAllowAnswers();
+        dataInstance().update([](databaseParam& p) { p = databaseParam(); });
+        Utils::resetStateForTest();
+        Utils::closeLog();
+    }
+
+    static Json request(const std::string& service, int deviceType, const std::string& name = "My Phone",
+                        const std::string& openId = "openid-of-pc", const std::string& port = "") {
+        Json extra = {{"deviceType", deviceType}};
+        if (!port.empty()) extra["port"] = port;
+        return {{"bytes", {0}},          {"target_id", "ABCDEFGH"}, {"account", "13812345678"},
+                {"deviceName", name},    {"open_Id", openId},       {"service_id", service},
+                {"extra_info", extra.dump()}};
+    }
+    // A test phone with its link to the server.
+    std::unique_ptr<TcpSocketBase> dial() {
+        startServer();
+        auto phone = std::make_unique<TcpSocketBase>();
+        EXPECT_TRUE(phone->initial(static_cast<std::uint16_t>(server.port()), "127.0.0.1", 10));
+        return phone;
+    }
+    std::unique_ptr<TcpSocketBase> send(const Bytes& frame) {
+        auto phone = dial();
+        EXPECT_TRUE(phone->sendMsg(10, frame));
+        return phone;
+    }
+    std::unique_ptr<TcpSocketBase> send(const Json& body) { return send(buildPhoneFrame(body.dump())); }
+    // The server's answer on the link (its raw body in `raw`); null when none came.
+    static Json answer(TcpSocketBase& phone, std::string* raw = nullptr) {
+        Bytes frame;
+        int error = 0;
+        if (!phone.recvMsg(kWait, frame, error)) return Json();
+        const std::string body = phoneFrameBody(frame);
+        if (raw) *raw = body;
+        return Json::parse(body);
+    }
+    // True when the server closed the link (with nothing more to read).
+    static bool closedByServer(TcpSocketBase& phone) {
+        Bytes frame;
+        int error = 0;
+        return !phone.recvMsg(kWait, frame, error) && error == -1;
+    }
+    static Json control(const std::string& event, Json args = Json::array()) {
+        const std::string answer = HttpService::handleBody(Json{{"event", event}, {"args", std::move(args)}}.dump());
+        return answer.empty() ? Json() : Json::parse(answer.substr(answer.find('#') + 1));
+    }
+    std::string todaysLog() const { return test::readAll(Utils::logFilePath(Utils::now())); }
+
+    test::HermeticEnv env;
+    ScopedFakePlatform fake;
+    test::StubPcSuite pcsuite;
+    std::unique_ptr<test::LaunchRecorder> window;
+    std::unique_ptr<test::LaunchRecorder> pcsuiteProgram;
+    SocketServer server;
+};
+
+TEST_F(PhoneServer, UserAgreesAndThePcSuiteGetsThePhone) {
+    auto phone = send(request("com.kesu.pcsuite.SERVICE", 1, "My Pad"));
+    const auto shown = window->next(kLong);
+    ASSERT_TRUE(shown);
+    EXPECT_EQ(*shown, (std::vector<std::string>{"1", "My Pad", "41424344", "138****678", "1", "pad"}));
+    EXPECT_FALSE(Utils::getIsCanConnectDevice());  // held while the request is handled
+    EXPECT_EQ(Utils::getConnectingDeviceType(), "pad");
+
+    EXPECT_EQ(control("QtAgree", {"true"}), (Json{{"error", 0}, {"error_message", "Close"}}));
+    std::string raw;
+    const Json agree = answer(*phone, &raw);
+    EXPECT_EQ(agree, (Json{{"bytes", {3}},
+                           {"deviceName", "Off****-PC"},
+                           {"channel", 0},
+                           {"id", 87654321},
+                           {"open_Id", "openid-of-pc"},
+                           {"service_id", "com.kesu.pcsuite.SERVICE"},
+                           {"target_id", "aabbccddeeff"},
+                           {"account", "138****5678"},
+                           {"type", "1"}}));
+    EXPECT_NE(raw.find('\n'), std::string::npos);  // pretty-printed
+    EXPECT_TRUE(closedByServer(*phone));
+    ASSERT_TRUE(server.waitForNoLinks(kLong));
+    EXPECT_TRUE(Utils::getIsCanConnectDevice());
+
+    // The PC suite was asked first, then got the telemetry record and the phone.
+    const auto busyCheck = pcsuite.requestsTo("/isConnectBusy");
+    ASSERT_EQ(busyCheck.size(), 1u);
+    EXPECT_EQ(busyCheck[0].param("deviceType"), "pad");
+    const auto bury = pcsuite.requestsTo("/buryPoint");
+    ASSERT_FALSE(bury.empty());
+    EXPECT_NE(bury[0].body.find("W688|10159"), std::string::npos) << bury[0].body;
+    const auto handOver = pcsuite.requestsTo("/");
+    ASSERT_EQ(handOver.size(), 1u);
+    const std::string& posted = handOver[0].body;
+    const auto hash = posted.find('#');
+    ASSERT_NE(hash, std::string::npos);
+    const Json message = Json::parse(posted.substr(hash + 1));
+    EXPECT_EQ(message, (Json{{"event", "nfcConection"},
+                             {"args", {"127.0.0.1", "My Pad", "WLAN", "41424344", "0", "true", "138****678", "pad", "1"}}}));
+    EXPECT_EQ(posted.substr(hash + 1), message.dump());  // compact after the count
+    EXPECT_NE(todaysLog().find("[launchService] success to send phone info to pcsuite, by http request(9199), phone ip "
+                               "is: 127.0.0.1"),
+              std::string::npos);
+}
+
+TEST_F(PhoneServer, OtherPhonesAreBusyWhileOneIsHandled) {
+    auto first = send(request("com.kesu.pcsuite.SERVICE", 0));
+    ASSERT_TRUE(window->next(kLong));  // the first request waits for the user
+
+    auto samePhone = send(request("com.kesu.pcsuite.SERVICE", 0, "Second Phone"));
+    EXPECT_EQ(answer(*samePhone)["bytes"], Json::array({11}));
+    EXPECT_TRUE(closedByServer(*samePhone));
+    auto pad = send(request("com.kesu.pcsuite.SERVICE", 1, "A Pad"));
+    const Json diff = answer(*pad);
+    EXPECT_EQ(diff["bytes"], Json::array({12}));
+    EXPECT_EQ(diff["service_id"], "com.kesu.pcsuite.SERVICE");
+    EXPECT_TRUE(closedByServer(*pad));
+
+    EXPECT_EQ(control("QtRefuse"), (Json{{"error", 0}, {"error_message", "Refuse"}}));
+    EXPECT_EQ(answer(*first)["bytes"], Json::array({4}));
+    EXPECT_TRUE(closedByServer(*first));
+    ASSERT_TRUE(server.waitForNoLinks(kLong));
+    EXPECT_TRUE(pcsuite.requestsTo("/").empty());  // a refused phone is not handed over
+    EXPECT_EQ(pcsuite.requestsTo("/isConnectBusy").size(), 1u);
+}
+
+TEST_F(PhoneServer, UnansweredWindowIsARefusal) {
+    env.config().allowWindowTimeout = 200ms;
+    auto phone = send(request("com.kesu.pcsuite.SERVICE", 0));
+    ASSERT_TRUE(window->next(kLong));
+    EXPECT_EQ(answer(*phone)["bytes"], Json::array({4}));
+    EXPECT_TRUE(closedByServer(*phone));
+    ASSERT_TRUE(server.waitForNoLinks(kLong));
+    EXPECT_TRUE(pcsuite.requestsTo("/").empty());
+    const std::string log = todaysLog();
+    EXPECT_NE(log.find("[startAllowedWindow]allow window event timedOut"), std::string::npos);
+    EXPECT_NE(log.find("[launchService] send tcp reject data to phone"), std::string::npos);
+}
+
+TEST_F(PhoneServer, UnreachablePcSuiteIsStartedWithThePhone) {
+    env.config().pcsuitePort = test::freeTcpPort();  // nobody listens there
+    auto phone = send(request("com.kesu.pcsuite.SERVICE", 0, "My Phone", "someone-else"));
+    const auto shown = window->next(kLong);
+    ASSERT_TRUE(shown);
+    EXPECT_EQ((*shown)[4], "0");  // not the signed-in account
+    control("QtAgree");
+    EXPECT_EQ(answer(*phone)["bytes"], Json::array({3}));
+    const auto started = pcsuiteProgram->next(kLong);
+    ASSERT_TRUE(started);
+    EXPECT_EQ(*started, (std::vector<std::string>{"--h=127.0.0.1", "--n=\"My Phone\"", "--seq=0", "--m=WLAN", "--i=41424344",
+                                                  "--a=false", "--account=138****678", "--dt=phone", "--as=0"}));
+    ASSERT_TRUE(server.waitForNoLinks(kLong));
+}
+
+TEST_F(PhoneServer, BusyPcSuiteAnswersByDeviceType) {
+    pcsuite.setAnswer("/isConnectBusy",
+                      {200, R"({"code":"000000","data":{"isConnectBusy":true,"deviceType":"phone","connectStatus":"connected"}})"});
+    auto phone = send(request("com.kesu.pcsuite.SERVICE", 0));
+    EXPECT_EQ(answer(*phone)["bytes"], Json::array({11}));
+    EXPECT_TRUE(closedByServer(*phone));
+    auto pad = send(request("com.kesu.pcsuite.SERVICE", 1));
+    EXPECT_EQ(answer(*pad)["bytes"], Json::array({12}));
+    EXPECT_TRUE(closedByServer(*pad));
+    ASSERT_TRUE(server.waitForNoLinks(kLong));
+    EXPECT_TRUE(Utils::getIsCanConnectDevice());
+    EXPECT_EQ(todaysLog().find("[startAllowedWindow]"), std::string::npos);  // no window for a busy PC suite
+}
+
+TEST_F(PhoneServer, SharingRequestsSkipTheAllowWindow) {
+    auto phone = send(request("com.kesu.share.CONNECT_PC", 1, "My Pad", "openid-of-pc", "7000"));
+    const Json agree = answer(*phone);
+    EXPECT_EQ(agree["bytes"], Json::array({3}));
+    EXPECT_EQ(agree["service_id"], "com.kesu.share.CONNECT_PC");
+    EXPECT_TRUE(closedByServer(*phone));
+    const auto shown = window->next(kLong);
+    ASSERT_TRUE(shown);
+    EXPECT_EQ(*shown, (std::vector<std::string>{"2", "My Pad", "41424344", "127.0.0.1:7000", "1", "/data/recv", "0",
+                                                "/data/recv"}));
+    EXPECT_TRUE(pcsuite.requestsTo("/isConnectBusy").empty());
+
+    // The receive folder follows the account; the one before it is handed on too, and a
+    // missing one is replaced by the default folder.
+    dataInstance().set(&databaseParam::storageDir, "/data/other");
+    auto second = send(request("com.kesu.share.CONNECT_PC", 0));
+    EXPECT_EQ(answer(*second)["bytes"], Json::array({3}));
+    auto next = window->next(kLong);
+    ASSERT_TRUE(next);
+    ASSERT_EQ(next->size(), 8u);
+    EXPECT_EQ((*next)[3], "127.0.0.1");
+    EXPECT_EQ((*next)[5], "/data/other");
+    EXPECT_EQ((*next)[7], "/data/recv");
+    dataInstance().set(&databaseParam::storageDir, "");
+    auto third = send(request("com.kesu.share.CONNECT_PC", 0));
+    EXPECT_EQ(answer(*third)["bytes"], Json::array({3}));
+    next = window->next(kLong);
+    ASSERT_TRUE(next);
+    EXPECT_EQ((*next)[5], rootedPath("/Users/recvFile"));
+    EXPECT_EQ((*next)[7], "/data/other");
+    ASSERT_TRUE(server.waitForNoLinks(kLong));
+    EXPECT_TRUE(Utils::getIsCanConnectDevice());  // sharing never holds the connection slot
+}
+
+TEST_F(PhoneServer, BadInputIsDroppedAndEveryLinkIsClosed) {
+    env.config().phoneLinkReadTimeout = 300ms;
+    const std::vector<Bytes> frames = {
+        buildPhoneFrame(""),                                       // 14 bytes: no body
+        buildPhoneFrame("{\"bytes\":[0],\"x\":\"\xff\xfe\"}"),     // not UTF-8
+        buildPhoneFrame("[0]"),                                    // not an object
+        buildPhoneFrame(R"({"bytes":[1]})"),                       // not a request
+        buildPhoneFrame(request("com.example.OTHER", 0).dump()),  // nobody's service
+        Bytes{'P', 'A', 'Y', '_', 'L', 'O', 'A', 'D', '_', '1', 0, 0, 0},  // a cut header, then silence
+        Bytes(2000, 'x'),                                          // not a frame at all
+    };
+    for (const Bytes& frame : frames) {
+        auto phone = send(frame);
+        EXPECT_TRUE(closedByServer(*phone)) << frame.size();
+    }
+    auto silent = dial();
+    EXPECT_TRUE(closedByServer(*silent));  // after the read time-out
+    ASSERT_TRUE(server.waitForNoLinks(kLong));
+    EXPECT_EQ(server.linkCount(), 0u);
+    EXPECT_TRUE(Utils::getIsCanConnectDevice());
+    EXPECT_TRUE(pcsuite.requests().empty());
+}
+
+TEST_F(PhoneServer, LinksAreBoundedAndStopEndsThem) {
+    env.config().phoneServerMaxLinks = 2;
+    auto waiting = send(request("com.kesu.pcsuite.SERVICE", 0));
+    ASSERT_TRUE(window->next(kLong));  // held in the allow window
+    auto silent = dial();
+    // Two links are open: a third is closed at once, long before any time-out.
+    auto extra = dial();
+    EXPECT_TRUE(closedByServer(*extra));
+    EXPECT_EQ(server.linkCount(), 2u);
+
+    // Stopping ends the window wait and the silent read at once.
+    auto stopped = std::async(std::launch::async, [this] { server.stop(); });
+    ASSERT_EQ(stopped.wait_for(60s), std::future_status::ready);
+    EXPECT_TRUE(closedByServer(*waiting));
+    EXPECT_TRUE(closedByServer(*silent));
+    EXPECT_EQ(server.linkCount(), 0u);
+    EXPECT_EQ(server.port(), 0);
+    EXPECT_TRUE(Utils::getIsCanConnectDevice());
+
+    // The server opens again.
+    ASSERT_TRUE(server.ConnectStatusGet());
+    auto again = send(request("com.kesu.share.CONNECT_PC", 0));
+    EXPECT_EQ(answer(*again)["bytes"], Json::array({3}));
+    ASSERT_TRUE(window->next(kLong));
+}
+
+TEST_F(PhoneServer, PortInUseIsReported) {
+    startServer();
+    env.config().phoneServerPort = server.port();
+    SocketServer second;
+    EXPECT_FALSE(second.ConnectStatusGet());
+    EXPECT_EQ(second.port(), 0);
+    EXPECT_NE(todaysLog().find("[ConnectStatusGet] Error! Server failed to connect as an error get: "), std::string::npos);
+}
+
+}  // namespace
+}  // namespace kesu
