@@ -1,10 +1,14 @@
 #include "core/ServiceManager.h"
 
+#include "connect/SocketServer.h"
+#include "core/Config.h"
 #include "core/RestartServiceSubscriber.h"
 #include "events/EventDetected.h"
 #include "events/PreConnectEventSubscriber.h"
 #include "events/SystemEventSubscriber.h"
 #include "core/Utils.h"
+#include "discovery/ServiceWorker.h"
+#include "pcsuite/DeviceReports.h"
 #include "events/EventPublisher.h"
 
 namespace kesu {
@@ -17,6 +21,21 @@ void ServiceManager::start() {
     started_ = true;
     Utils::mPrintlog("[Server Start]this is ServiceManager \n");
 
+    // LAN discovery (adapter check and announcement loop), then the pre-connection scheduler.
+    serviceWorker_ = std::make_unique<ServiceWorker>();
+    serviceWorker_->start();
+
+    // The server for phone-initiated connections.
+    ServerWorkAct().ServerAccept();
+
+    // LAN device list: a first report now, then on every new or changed device and on expiry.
+    wlanReportDevices_ = std::make_shared<WlanReportDevices>();
+    wlanReportDevices_->notify();
+    WlanDetectedDeviceCompare::instance().addObserver(wlanReportDevices_);
+    wlanDeviceDelete_ = std::make_unique<WlanDeviceDelete>();
+    wlanDeviceDelete_->addObserver(wlanReportDevices_);
+    wlanDeviceDelete_->detectedToDelete(Config::current().expirySweepPeriod);
+
     // Event subscribers, in their registration order.
     subscribers_ = {std::make_shared<PreConnectEventSubscriber>(), std::make_shared<RestartServiceSubscriber>(),
                     std::make_shared<SystemEventSubscriber>()};
@@ -27,10 +46,22 @@ void ServiceManager::start() {
 void ServiceManager::stop() {
     if (!started_) return;
     started_ = false;
+    if (serviceWorker_) serviceWorker_->stop();  // the network events' publisher goes first
+    serviceWorker_.reset();
+    SocketServer::singleton().stop();
     eventDetected_.reset();
     EventPublisher::instance().clearObservers();
     for (const auto& subscriber : subscribers_) subscriber->waitIdle(std::chrono::seconds(5));
     subscribers_.clear();
+    // Device list reports: no more sweeps, no reporter left behind, nothing waiting to go.
+    if (wlanDeviceDelete_) wlanDeviceDelete_->stop();
+    wlanDeviceDelete_.reset();
+    if (wlanReportDevices_) {
+        WlanDetectedDeviceCompare::instance().removeObserver(wlanReportDevices_);
+        wlanReportDevices_->stop();
+    }
+    wlanReportDevices_.reset();
+    ReportDevicesV2::instance().cancel();
 }
 
 void ServiceManager::restart() {

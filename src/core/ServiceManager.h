@@ -9,6 +9,9 @@ namespace kesu {
 
 class IEventSubscriber;
 class EventDetected;
+class ServiceWorker;
+class WlanReportDevices;
+class WlanDeviceDelete;
 
 class ServiceManager {
 public:
@@ -25,6 +28,9 @@ private:
     bool started_ = false;
     std::vector<std::shared_ptr<IEventSubscriber>> subscribers_;
     std::unique_ptr<EventDetected> eventDetected_;
+    std::unique_ptr<ServiceWorker> serviceWorker_;
+    std::shared_ptr<WlanReportDevices> wlanReportDevices_;
+    std::unique_ptr<WlanDeviceDelete> wlanDeviceDelete_;
 };
 
 }  // namespace kesu

@@ -14,6 +14,7 @@
 #include <thread>
 
 #include "core/TimeUtil.h"
+#include "e2e/PrivateNetwork.h"
 #include "support/ServiceProcess.h"
 #include "support/TestSupport.h"
 
@@ -33,6 +34,7 @@ constexpr bool kMeasureMemory = true;
 #endif
 
 struct Daemon {
+    bool skip = !kesu::test::inPrivateNetwork();
     TempDir dir;
     std::string home = dir.str() + "/home";
     std::string root = dir.str() + "/root";
@@ -43,6 +45,7 @@ struct Daemon {
     }
     std::map<std::string, std::string> env() const { return {{"HOME", home}, {"KESU_ROOT", root}}; }
     std::unique_ptr<ServiceProcess> start() const {
+        if (skip) return nullptr;
         auto p = std::make_unique<ServiceProcess>(KESU_BINARY, std::vector<std::string>{}, env());
         EXPECT_TRUE(p->waitForOutput("[httpService]Run succ", 20s)) << p->output();
         return p;
@@ -96,6 +99,7 @@ std::string firstNonLoopbackIpv4() {
 
 TEST(ServiceE2E, AnswersHeartbeatWritesVersionAndLogAndStopsCleanly) {
     Daemon daemon;
+    if (daemon.skip) GTEST_SKIP() << "*** no private network namespace (needs root): not starting the service ***";
     auto service = daemon.start();
 
     const std::string answer = heartbeat();
@@ -127,6 +131,7 @@ TEST(ServiceE2E, AnswersHeartbeatWritesVersionAndLogAndStopsCleanly) {
 
 TEST(ServiceE2E, SecondInstanceLeavesTheFirstRunning) {
     Daemon daemon;
+    if (daemon.skip) GTEST_SKIP() << "*** no private network namespace (needs root): not starting the service ***";
     auto first = daemon.start();
 
     ServiceProcess second(KESU_BINARY, {}, daemon.env());
@@ -141,6 +146,7 @@ TEST(ServiceE2E, ControlPortIsLoopbackOnly) {
     const std::string address = firstNonLoopbackIpv4();
     if (address.empty()) GTEST_SKIP() << "this machine has no non-loopback IPv4 address";
     Daemon daemon;
+    if (daemon.skip) GTEST_SKIP() << "*** no private network namespace (needs root): not starting the service ***";
     auto service = daemon.start();
     EXPECT_FALSE(post(R"({"event":"HeartBeat"})", address)) << "reachable on " << address;
     EXPECT_TRUE(isAlive(heartbeat()));
@@ -148,6 +154,7 @@ TEST(ServiceE2E, ControlPortIsLoopbackOnly) {
 
 TEST(ServiceE2E, SurvivesHostileBodies) {
     Daemon daemon;
+    if (daemon.skip) GTEST_SKIP() << "*** no private network namespace (needs root): not starting the service ***";
     auto service = daemon.start();
 
     const std::string deep(100000, '[');
