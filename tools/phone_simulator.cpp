@@ -21,6 +21,7 @@
 //                        answer to a PC's request (default accept); prints
 //                        "SIM TCP_REQUEST <body>" and "SIM TCP_ANSWERED <tag>"
 //   --connect HOST:PORT  send a connection request to a PC; prints "SIM TCP_ANSWER <body>"
+//                        (bodies are printed on one line, JSON compacted)
 //   --service S          service id of that request (default com.kesu.pcsuite.SERVICE)
 //   --duration S         run for S seconds then exit (default 30, at most 3600)
 //   --help
@@ -75,6 +76,15 @@ struct Options {
 
 void say(const std::string& line) {
     std::cout << "SIM " << line << std::endl;
+}
+
+// A frame body on one line: JSON compacted (answers may come pretty-printed), other text as is.
+std::string oneLine(const std::string& body) {
+    auto j = nlohmann::json::parse(body, nullptr, false);
+    if (!j.is_discarded()) return j.dump();
+    std::string text = body;
+    std::replace(text.begin(), text.end(), '\n', ' ');
+    return text;
 }
 
 void usage() {
@@ -223,7 +233,7 @@ bool onConnData(Conn& c, const Options& o) {
     c.cutter.feed(std::string_view(buf, static_cast<std::size_t>(n)));
     while (auto frame = c.cutter.next()) {
         std::string body = kesu::phoneFrameBody(*frame);
-        say("TCP_REQUEST " + body);
+        say("TCP_REQUEST " + oneLine(body));
         if (c.answered || o.answer == "silent") continue;
         int tag = o.answer == "reject" ? 2 : o.answer == "busy" ? 11 : 1;
         c.answered = writeAll(c.fd, kesu::buildPhoneFrameFromJson(nlohmann::json{{"bytes", {tag}}}));
@@ -261,7 +271,7 @@ void connectToPc(const Options& o, Clock::time_point deadline) {
         if (n <= 0) { say("TCP_CLOSED"); break; }
         cutter.feed(std::string_view(buf, static_cast<std::size_t>(n)));
         if (auto frame = cutter.next()) {
-            say("TCP_ANSWER " + kesu::phoneFrameBody(*frame));
+            say("TCP_ANSWER " + oneLine(kesu::phoneFrameBody(*frame)));
             break;
         }
     }

@@ -3,81 +3,46 @@
 // skipped (loudly) otherwise.
 #include <gtest/gtest.h>
 
-#include <filesystem>
 #include <nlohmann/json.hpp>
 #include <set>
 
-#include "support/NetNs.h"
-#include "support/ServiceProcess.h"
-#include "support/TestSupport.h"
+#include "e2e/E2EFixture.h"
 
 using namespace std::chrono_literals;
-using kesu::test::NetNsLab;
-using kesu::test::ServiceProcess;
-using kesu::test::TempDir;
+using namespace kesu::test;
 
 namespace {
 
-const std::string kSimulator = std::string(KESU_TOOLS_DIR) + "/phone_simulator";
+using DiscoveryE2E = LabTest;
 
-// The text after `marker` on the first line of `output` that holds it.
-std::string lineAfter(const std::string& output, const std::string& marker) {
-    auto at = output.find(marker);
-    if (at == std::string::npos) return {};
-    at += marker.size();
-    return output.substr(at, output.find('\n', at) - at);
+// The JSON of the last PC announcement the simulator printed.
+nlohmann::json lastAnnouncement(const ServiceProcess& sim) {
+    const std::string out = sim.output();
+    const std::string marker = "SIM PC_ANNOUNCE ";
+    const auto at = out.rfind(marker);
+    if (at == std::string::npos) return nullptr;
+    return nlohmann::json::parse(lineAfter(out.substr(at), marker), nullptr, false);
 }
 
-// Posts one control request from inside `ns` (the control API listens on that namespace's
-// loopback) and returns the JSON after the length prefix of the answer.
-nlohmann::json control(const std::string& ns, const std::string& event) {
-    const std::string body = nlohmann::json{{"event", event}, {"args", nlohmann::json::array()}}.dump();
-    ServiceProcess curl("/usr/bin/curl",
-                        {"-s", "-m", "5", "--data-binary", std::to_string(body.size()) + "#" + body,
-                         "-H", "Content-Type: text/plain", "http://127.0.0.1:9197/"},
-                        {}, ns);
-    curl.waitExit(10s);
-    std::string out = curl.output();
-    auto hash = out.find('#');
-    if (hash == std::string::npos) return nullptr;
-    return nlohmann::json::parse(out.substr(hash + 1), nullptr, false);
+// The device with `id` in a posted device list (null when absent or not a list).
+nlohmann::json deviceIn(const std::string& listText, const std::string& id) {
+    const auto list = nlohmann::json::parse(listText, nullptr, false);
+    if (!list.is_array()) return nullptr;
+    for (const auto& d : list)
+        if (d.is_object() && d.value("deviceId", "") == id) return d;
+    return nullptr;
 }
-
-class DiscoveryE2E : public ::testing::Test {
-protected:
-    void SetUp() override {
-        std::string why;
-        if (!NetNsLab::available(&why)) GTEST_SKIP() << "*** NETWORK NAMESPACES UNAVAILABLE: " << why << " ***";
-        lab = std::make_unique<NetNsLab>("e2e", true);
-        pc = lab->addNode("pc", 1);
-        phone = lab->addNode("phone", 2);
-        ASSERT_TRUE(lab->ok()) << lab->error();
-        std::filesystem::create_directories(home);
-        std::filesystem::create_directories(root);
-    }
-    std::unique_ptr<ServiceProcess> startService() {
-        auto p = std::make_unique<ServiceProcess>(KESU_BINARY, std::vector<std::string>{},
-                                                  std::map<std::string, std::string>{{"HOME", home}, {"KESU_ROOT", root}},
-                                                  pc.ns);
-        EXPECT_TRUE(p->waitForOutput("[httpService]Run succ", 20s)) << p->output();
-        return p;
-    }
-
-    std::unique_ptr<NetNsLab> lab;
-    NetNsLab::Node pc, phone;
-    TempDir dir;
-    std::string home = dir.str() + "/home";
-    std::string root = dir.str() + "/root";
-};
 
 TEST_F(DiscoveryE2E, PhoneHearsThePcAnnouncement) {
+    writeAccount("pc-open-1", "13912345678");
     auto service = startService();
-    ServiceProcess sim(kSimulator, {"--iface-ip", phone.ip, "--listen", "--duration", "20"}, {}, phone.ns);
-    ASSERT_TRUE(sim.waitForOutput("SIM PC_ANNOUNCE {", 8s)) << sim.output() << "\n--- service:\n" << service->output();
-    EXPECT_EQ(sim.output().find("UDP_BAD_ENVELOPE"), std::string::npos) << sim.output();
-    EXPECT_EQ(lineAfter(sim.output(), "SIM PC_ANNOUNCE_FROM "), pc.ip);
+    auto sim = startSimulator(phone.ns, {"--iface-ip", phone.ip, "--listen", "--duration", "20"});
+    ASSERT_TRUE(sim->waitForOutput("SIM PC_ANNOUNCE {", 8s)) << sim->output() << "\n--- service:\n"
+                                                              << service->output();
+    EXPECT_EQ(sim->output().find("UDP_BAD_ENVELOPE"), std::string::npos) << sim->output();
+    EXPECT_EQ(lineAfter(sim->output(), "SIM PC_ANNOUNCE_FROM "), pc.ip);
 
-    auto j = nlohmann::json::parse(lineAfter(sim.output(), "SIM PC_ANNOUNCE "), nullptr, false);
+    auto j = lastAnnouncement(*sim);
     ASSERT_TRUE(j.is_object());
     std::set<std::string> keys;
     for (auto& [k, v] : j.items()) keys.insert(k);
@@ -87,24 +52,26 @@ TEST_F(DiscoveryE2E, PhoneHearsThePcAnnouncement) {
     EXPECT_EQ(j["port"], 10191);
     EXPECT_EQ(j["deviceType"], "pc");
     EXPECT_EQ(j["extra"], "null");
-    EXPECT_TRUE(j["deviceName"].is_string() && j["deviceId"].is_string() && j["openId"].is_string() &&
-                j["account"].is_string());
+    EXPECT_EQ(j["openId"], "pc-open-1");
+    EXPECT_EQ(j["account"], "139****678");  // the account's phone is kept masked
+    EXPECT_TRUE(j["deviceName"].is_string() && j["deviceId"].is_string());
+
+    // The announcement repeats: the next one arrives within about one more period.
+    EXPECT_TRUE(sim->waitForOutput("SIM PC_ANNOUNCE_FROM", 8s, sim->output().size()));
 }
 
 TEST_F(DiscoveryE2E, PhoneAnnouncementsLandInTheDeviceTable) {
     auto service = startService();
     // One phone in the current format, one pad in the old format; both repeat every second
     // until the service has them.
-    ServiceProcess current(kSimulator, {"--iface-ip", phone.ip, "--announce-every", "1", "--duration", "20",
-                                        "--name", "kesu Sim Phone", "--id", "SIMPHONE01", "--account",
-                                        "13800000000", "--openid", "open-1"},
-                           {}, phone.ns);
-    ServiceProcess old(kSimulator, {"--iface-ip", phone.ip, "--announce-every", "1", "--duration", "20",
-                                    "--format", "old", "--type", "pad", "--name", "Tab", "--id", "ab",
-                                    "--account", "acc", "--openid", "open-2", "--guide", "7x"},
-                       {}, phone.ns);
-    ASSERT_TRUE(current.waitForOutput("SIM ANNOUNCED", 5s)) << current.output();
-    ASSERT_TRUE(old.waitForOutput("SIM ANNOUNCED", 5s)) << old.output();
+    auto current = startSimulator(phone.ns, {"--iface-ip", phone.ip, "--announce-every", "1", "--duration", "20",
+                                             "--name", "kesu Sim Phone", "--id", "SIMPHONE01", "--account",
+                                             "13800000000", "--openid", "open-1"});
+    auto old = startSimulator(phone.ns, {"--iface-ip", phone.ip, "--announce-every", "1", "--duration", "20",
+                                         "--format", "old", "--type", "pad", "--name", "Tab", "--id", "ab",
+                                         "--account", "acc", "--openid", "open-2", "--guide", "7x"});
+    ASSERT_TRUE(current->waitForOutput("SIM ANNOUNCED", 5s)) << current->output();
+    ASSERT_TRUE(old->waitForOutput("SIM ANNOUNCED", 5s)) << old->output();
     // The service logs each insertion; wait for both before asking.
     ASSERT_TRUE(service->waitForOutput("Insert ssdp device, deviceId: 53494d50", 10s)) << service->output();
     ASSERT_TRUE(service->waitForOutput("Insert ssdp device, deviceId: 6162", 10s)) << service->output();
@@ -112,11 +79,8 @@ TEST_F(DiscoveryE2E, PhoneAnnouncementsLandInTheDeviceTable) {
     auto answer = control(pc.ns, "SSDPQueryAll");
     ASSERT_TRUE(answer.is_object()) << answer;
     ASSERT_TRUE(answer.contains("data") && answer["data"].is_array()) << answer;
-    nlohmann::json phoneRec, padRec;
-    for (auto& d : answer["data"]) {
-        if (d.value("deviceId", "") == "53494d50") phoneRec = d;
-        if (d.value("deviceId", "") == "6162") padRec = d;
-    }
+    const auto phoneRec = deviceIn(answer["data"].dump(), "53494d50");
+    const auto padRec = deviceIn(answer["data"].dump(), "6162");
     ASSERT_TRUE(phoneRec.is_object()) << answer;
     EXPECT_EQ(phoneRec["deviceName"], "Sim****one");  // "kesu " stripped, 9 characters masked
     EXPECT_EQ(phoneRec["isDeviceNameFull"], false);
@@ -131,6 +95,57 @@ TEST_F(DiscoveryE2E, PhoneAnnouncementsLandInTheDeviceTable) {
     EXPECT_EQ(padRec["account"], "acc");
     EXPECT_EQ(padRec["guide"], "7");  // old format: one character only
     EXPECT_EQ(padRec["deviceType"], "pad");
+}
+
+// The PC suite is told of a phone when it appears, and again when the phone has been silent
+// for longer than the expiry (30 s) and the sweep has dropped it.
+TEST_F(DiscoveryE2E, PcSuiteGetsTheListWhenAPhoneAppearsAndExpires) {
+    auto pcsuite = startPcSuite();
+    ASSERT_TRUE(pcsuite);
+    auto service = startService();
+    auto sim = startSimulator(phone.ns, {"--iface-ip", phone.ip, "--announce-every", "0", "--duration", "60",
+                                         "--id", "SIMPHONE01", "--account", "13800000000"});
+    ASSERT_TRUE(sim->waitForOutput("SIM ANNOUNCED", 5s)) << sim->output();
+    const auto silentSince = std::chrono::steady_clock::now();
+
+    const auto appeared = pcsuite->waitForRequest(
+        [](const RecordedRequest& r) {
+            return r.method == "POST" && r.path == "/SSDPQueryAll" && deviceIn(r.body, "53494d50").is_object();
+        },
+        10s);
+    ASSERT_TRUE(appeared) << service->output();
+    const auto record = deviceIn(appeared->body, "53494d50");
+    EXPECT_EQ(record["account"], "138****000");
+    EXPECT_EQ(record["ip"], nlohmann::json::array({phone.ip}));
+
+    const auto gone = pcsuite->waitForRequest(
+        [&](const RecordedRequest& r) {
+            return r.method == "POST" && r.path == "/SSDPQueryAll" && r.receivedAt > appeared->receivedAt &&
+                   nlohmann::json::parse(r.body, nullptr, false).is_array() && deviceIn(r.body, "53494d50").is_null();
+        },
+        45s);
+    ASSERT_TRUE(gone) << service->output();
+    const auto silence = std::chrono::duration_cast<std::chrono::milliseconds>(gone->receivedAt - silentSince);
+    EXPECT_GT(silence, 30s) << "dropped before the expiry";
+    EXPECT_LT(silence, 40s) << "the expiry sweep and the report lag far behind";
+}
+
+// A sign-in written by the PC suite into Config.db is noticed by the database monitor and
+// goes out in the next announcement.
+TEST_F(DiscoveryE2E, AccountChangeReachesTheNextAnnouncement) {
+    writeAccount("first-open-id", "13900000001");
+    auto service = startService();
+    auto sim = startSimulator(phone.ns, {"--iface-ip", phone.ip, "--listen", "--duration", "60"});
+    ASSERT_TRUE(sim->waitForOutput("\"openId\":\"first-open-id\"", 10s)) << sim->output();
+
+    const auto logMark = service->output().size();
+    writeAccount("second-open-id", "13900000002");
+    // The monitor polls every 3 s: the change is read within one period and a little.
+    ASSERT_TRUE(service->waitForOutput("DataBase file changed recently", 5s, logMark)) << service->output();
+    ASSERT_TRUE(sim->waitForOutput("\"openId\":\"second-open-id\"", 8s)) << sim->output();
+    const auto j = lastAnnouncement(*sim);
+    EXPECT_EQ(j["openId"], "second-open-id");
+    EXPECT_EQ(j["account"], "139****002");
 }
 
 }  // namespace

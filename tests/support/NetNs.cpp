@@ -1,8 +1,12 @@
 #include "support/NetNs.h"
 
+#include <fcntl.h>
+#include <sched.h>
 #include <unistd.h>
 
 #include <cstdlib>
+#include <exception>
+#include <thread>
 
 namespace kesu::test {
 
@@ -13,6 +17,27 @@ constexpr const char* kLeftoverNodes[] = {"pc", "phone", "phone2", "n0", "n1", "
 bool NetNsLab::ip(const std::string& args) {
     std::string cmd = "ip " + args + " >/dev/null 2>&1";
     return std::system(cmd.c_str()) == 0;
+}
+
+bool NetNsLab::runIn(const std::string& ns, const std::function<void()>& fn) {
+    bool entered = false;
+    std::exception_ptr failure;
+    // setns() moves only the calling thread, so a short-lived thread does the work.
+    std::thread worker([&] {
+        const int fd = ::open(("/run/netns/" + ns).c_str(), O_RDONLY | O_CLOEXEC);
+        if (fd < 0) return;
+        entered = ::setns(fd, CLONE_NEWNET) == 0;
+        ::close(fd);
+        if (!entered) return;
+        try {
+            fn();
+        } catch (...) {
+            failure = std::current_exception();
+        }
+    });
+    worker.join();
+    if (failure) std::rethrow_exception(failure);
+    return entered;
 }
 
 bool NetNsLab::available(std::string* why) {

@@ -3,6 +3,7 @@
 // and a multicast route, all removed again at the end of the scope.
 #pragma once
 
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -35,6 +36,12 @@ public:
 
     // Runs `ip` with the arguments; true on exit code 0.
     static bool ip(const std::string& args);
+
+    // Runs `fn` on a thread of its own that has entered the namespace `ns` (made by `ip netns
+    // add`). Sockets `fn` opens belong to that namespace for good, whichever thread uses them
+    // later. False when the namespace could not be entered (then `fn` did not run); an
+    // exception from `fn` is passed on.
+    static bool runIn(const std::string& ns, const std::function<void()>& fn);
 
 private:
     void removeLeftovers();

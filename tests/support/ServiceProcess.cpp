@@ -92,10 +92,11 @@ void ServiceProcess::readLoop(int fd) {
     cv_.notify_all();
 }
 
-bool ServiceProcess::waitForOutput(const std::string& text, std::chrono::milliseconds timeout) {
+bool ServiceProcess::waitForOutput(const std::string& text, std::chrono::milliseconds timeout, std::size_t from) {
     std::unique_lock<std::mutex> lock(mutex_);
-    cv_.wait_for(lock, timeout, [&] { return output_.find(text) != std::string::npos || outputClosed_; });
-    return output_.find(text) != std::string::npos;
+    const auto found = [&] { return from <= output_.size() && output_.find(text, from) != std::string::npos; };
+    cv_.wait_for(lock, timeout, [&] { return found() || outputClosed_; });
+    return found();
 }
 
 std::string ServiceProcess::output() const {

@@ -26,9 +26,9 @@ public:
     ServiceProcess& operator=(const ServiceProcess&) = delete;
 
     pid_t pid() const { return pid_; }
-    // Waits until the output holds `text`; false at the time-out or when the child ended
-    // without printing it.
-    bool waitForOutput(const std::string& text, std::chrono::milliseconds timeout);
+    // Waits until the output from byte `from` on holds `text`; false at the time-out or when
+    // the child ended without printing it.
+    bool waitForOutput(const std::string& text, std::chrono::milliseconds timeout, std::size_t from = 0);
     std::string output() const;
     // Waits for the child to end; its exit code (128+signal when killed), nullopt at the
     // time-out.

@@ -21,16 +21,20 @@ std::string RecordedRequest::param(const std::string& name) const {
     return it == params.end() ? std::string() : it->second;
 }
 
-StubPcSuite::StubPcSuite() : server_(std::make_unique<httplib::Server>()) { start(); }
+StubPcSuite::StubPcSuite() : server_(std::make_unique<httplib::Server>()) { start("127.0.0.1", 0); }
+
+StubPcSuite::StubPcSuite(const std::string& host, int port) : server_(std::make_unique<httplib::Server>()) {
+    start(host, port);
+}
 
 StubPcSuite::StubPcSuite(const std::string& certPath, const std::string& keyPath)
     : tls_(true), server_(std::make_unique<httplib::SSLServer>(certPath.c_str(), keyPath.c_str())) {
-    start();
+    start("127.0.0.1", 0);
 }
 
 StubPcSuite::~StubPcSuite() { stop(); }
 
-void StubPcSuite::start() {
+void StubPcSuite::start(const std::string& host, int port) {
     if (!server_->is_valid()) throw std::runtime_error("stub PC suite: server could not be set up");
 
     // Handlers per method (not the pre-routing hook) so that the body has been read.
@@ -63,7 +67,8 @@ void StubPcSuite::start() {
     server_->Delete(everything, handler);
     server_->Options(everything, handler);
 
-    port_ = server_->bind_to_any_port("127.0.0.1");
+    if (host != "0.0.0.0") host_ = host;
+    port_ = port == 0 ? server_->bind_to_any_port(host) : (server_->bind_to_port(host, port) ? port : -1);
     if (port_ <= 0) throw std::runtime_error("stub PC suite: no port to listen on");
     httplib::Server* raw = server_.get();
     listener_ = std::thread([raw] { raw->listen_after_bind(); });
@@ -80,7 +85,7 @@ void StubPcSuite::start() {
 }
 
 std::string StubPcSuite::baseUrl() const {
-    return std::string(tls_ ? "https" : "http") + "://127.0.0.1:" + std::to_string(port_) + "/";
+    return std::string(tls_ ? "https" : "http") + "://" + host_ + ":" + std::to_string(port_) + "/";
 }
 
 void StubPcSuite::pointPcsuiteHere(Config& config) const {
@@ -139,6 +144,18 @@ std::size_t StubPcSuite::requestCount() const {
 bool StubPcSuite::waitForRequests(std::size_t count, std::chrono::milliseconds timeout) const {
     std::unique_lock<std::mutex> lock(mutex_);
     return changed_.wait_for(lock, timeout, [&] { return requests_.size() >= count; });
+}
+
+std::optional<RecordedRequest> StubPcSuite::waitForRequest(const std::function<bool(const RecordedRequest&)>& match,
+                                                         std::chrono::milliseconds timeout) const {
+    std::optional<RecordedRequest> found;
+    std::unique_lock<std::mutex> lock(mutex_);
+    changed_.wait_for(lock, timeout, [&] {
+        for (const auto& r : requests_)
+            if (match(r)) return found = r, true;
+        return false;
+    });
+    return found;
 }
 
 void StubPcSuite::clearRequests() {

@@ -8,9 +8,11 @@
 #include <chrono>
 #include <condition_variable>
 #include <deque>
+#include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -45,6 +47,8 @@ class StubPcSuite {
 public:
     // Plain HTTP on 127.0.0.1, an ephemeral port.
     StubPcSuite();
+    // Plain HTTP on a chosen address and port ("0.0.0.0" for every address).
+    StubPcSuite(const std::string& host, int port);
     // https with the given certificate chain and key (PEM files).
     StubPcSuite(const std::string& certPath, const std::string& keyPath);
     ~StubPcSuite();
@@ -72,16 +76,21 @@ public:
     std::size_t requestCount() const;
     // Waits until at least `count` requests have arrived (in all) or `timeout` passed.
     bool waitForRequests(std::size_t count, std::chrono::milliseconds timeout) const;
+    // Waits for the first recorded request (in arrival order) that `match` accepts; nullopt
+    // at the time-out.
+    std::optional<RecordedRequest> waitForRequest(const std::function<bool(const RecordedRequest&)>& match,
+                                                  std::chrono::milliseconds timeout) const;
     void clearRequests();
 
     // Stops listening and ends delayed answers; called by the destructor.
     void stop();
 
 private:
-    void start();
+    void start(const std::string& host, int port);
     CannedAnswer answerFor(const std::string& path);
 
     bool tls_ = false;
+    std::string host_ = "127.0.0.1";  // where a client reaches the stub
     std::unique_ptr<httplib::Server> server_;
     std::thread listener_;
     int port_ = 0;

@@ -1,0 +1,61 @@
+// Shared set-up of the end-to-end tests across network namespaces: a bridged lab with the PC
+// node (where the real service runs with its own HOME and KESU_ROOT) and phone nodes, the
+// control API reached from inside the PC node, the account database, and stand-in programs
+// in the PC suite's bundle that report how they were launched.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <memory>
+#include <nlohmann/json.hpp>
+#include <string>
+#include <vector>
+
+#include "support/NetNs.h"
+#include "support/ServiceProcess.h"
+#include "support/StubPcSuite.h"
+#include "support/TestSupport.h"
+
+namespace kesu::test {
+
+// The text after `marker` on the first line of `output` that holds it ("" when none).
+std::string lineAfter(const std::string& output, const std::string& marker);
+
+// The phone simulator tool, started inside `ns`.
+std::unique_ptr<ServiceProcess> startSimulator(const std::string& ns, const std::vector<std::string>& args);
+
+// Posts one control request from inside `ns` (the control API listens on that namespace's
+// loopback) and returns the JSON after the length prefix of the answer (null when none).
+nlohmann::json control(const std::string& ns, const std::string& event,
+                       const nlohmann::json& args = nlohmann::json::array());
+
+class LabTest : public ::testing::Test {
+protected:
+    void SetUp() override;
+
+    // Adds a phone node 10.77.0.<host> to the lab.
+    NetNsLab::Node addPhone(const std::string& name, int host);
+    // Starts the real service in the PC node and waits until its control API runs.
+    std::unique_ptr<ServiceProcess> startService();
+    // A stand-in for the PC suite's HTTP server on every address of the PC node, port 9199.
+    std::unique_ptr<StubPcSuite> startPcSuite();
+    // Writes the PC suite's account database anew with one signed-in user.
+    void writeAccount(const std::string& openId, const std::string& phone, const std::string& token = "tok");
+
+    // Installs a stand-in for a program of the bundle (a fixed path below KESU_ROOT): when
+    // launched it posts its arguments to the recorder, as one request to /launched/<name>
+    // whose body holds them NUL-separated; `more` is shell text run after that.
+    void installProgram(const std::string& fixedPath, const std::string& name, const std::string& more = "");
+    // Waits for the launch of the program `name`; its arguments (nullopt at the time-out).
+    std::optional<std::vector<std::string>> waitForLaunch(const std::string& name, std::chrono::milliseconds timeout);
+
+    std::unique_ptr<NetNsLab> lab;
+    NetNsLab::Node pc, phone;
+    TempDir dir;
+    std::string home = dir.str() + "/home";
+    std::string root = dir.str() + "/root";
+    std::unique_ptr<StubPcSuite> recorder;  // in the PC node; receives the program launches
+};
+
+}  // namespace kesu::test
