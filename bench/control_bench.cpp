@@ -12,9 +12,8 @@
 #include <spawn.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
-#include <unistd.h>
-
 #include <fcntl.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cstdlib>
@@ -27,16 +26,12 @@
 #include <thread>
 #include <vector>
 
-extern char** environ;
+#include "BenchSupport.h"
+
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
-double percentile(std::vector<double> v, double p) {
-    std::sort(v.begin(), v.end());
-    return v[static_cast<size_t>(p * static_cast<double>(v.size() - 1))];
-}
+using namespace kesu::bench;
 
 // A raw TCP echo on loopback: the floor for any request/answer exchange on this machine.
 std::vector<double> echoRoundTrips(int count, size_t payload) {
@@ -111,65 +106,31 @@ long rssKiB(pid_t pid) {
 int main(int argc, char** argv) {
     // The service announces itself on every adapter: run it in a network namespace of its
     // own (loopback only) so that nothing leaves the machine.
-    if (unshare(CLONE_NEWNET) != 0 || std::system("ip link set lo up") != 0) {
+    const std::string netns = "kesubench-control";
+    if (!enterNewNamespace(netns)) {
         std::fprintf(stderr, "control_bench needs root for a private network namespace\n");
         return 1;
     }
     const int requests = argc > 1 ? std::atoi(argv[1]) : 2000;
     const int idleSeconds = argc > 2 ? std::atoi(argv[2]) : 30;
 
-    char tmpl[] = "/tmp/kesu-bench-XXXXXX";
-    const std::string dir = mkdtemp(tmpl);
-    std::filesystem::create_directories(dir + "/home");
-    std::filesystem::create_directories(dir + "/root");
-    std::vector<std::string> envs;
-    for (char** e = environ; *e; ++e) {
-        std::string s(*e);
-        if (s.rfind("HOME=", 0) != 0 && s.rfind("KESU_ROOT=", 0) != 0) envs.push_back(s);
-    }
-    envs.push_back("HOME=" + dir + "/home");
-    envs.push_back("KESU_ROOT=" + dir + "/root");
-    std::vector<char*> cenv;
-    for (auto& e : envs) cenv.push_back(e.data());
-    cenv.push_back(nullptr);
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
-    pid_t pid = 0;
-    char* args[] = {const_cast<char*>(KESU_BINARY), nullptr};
-    if (posix_spawn(&pid, KESU_BINARY, &actions, nullptr, args, cenv.data()) != 0) {
-        std::fprintf(stderr, "cannot start %s\n", KESU_BINARY);
-        return 1;
-    }
-
-    httplib::Client client("127.0.0.1", 9197);
-    client.set_keep_alive(true);
-    client.set_tcp_nodelay(true);
-    const std::string body = R"(32#{"event":"HeartBeat","args":[]})";
-    // Wait for the server: the first answered request (bounded).
-    bool up = false;
-    for (int i = 0; i < 100 && !up; ++i) {
-        auto res = client.Post("/", body, "text/plain");
-        up = res && res->status == 200;
-        if (!up) std::this_thread::sleep_for(std::chrono::milliseconds(100));
-    }
-    if (!up) {
+    BenchService service(netns);
+    if (!service.waitUntilUp()) {
         std::fprintf(stderr, "service did not answer\n");
-        kill(pid, SIGKILL);
         return 1;
     }
+    const pid_t pid = service.pid();
+    const std::string body = controlBody("HeartBeat");
 
     std::vector<double> http;
-    std::string answer;
     for (int i = 0; i < requests; ++i) {
         auto t0 = Clock::now();
-        auto res = client.Post("/", body, "text/plain");
-        http.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
-        if (!res) {
+        const bool answered = service.control(body).has_value();
+        http.push_back(micros(Clock::now() - t0));
+        if (!answered) {
             std::fprintf(stderr, "request %d failed\n", i);
             break;
         }
-        answer = res->body;
     }
     const auto echo = echoRoundTrips(requests, body.size() + 120);
 
@@ -188,9 +149,6 @@ int main(int argc, char** argv) {
     std::printf("idle over %d s: CPU %.3f %%  RSS %ld KiB -> %ld KiB\n", idleSeconds,
                 100.0 * static_cast<double>(t1 - t0) / static_cast<double>(hz) / idleSeconds, rss0, rss1);
 
-    kill(pid, SIGTERM);
-    int status = 0;
-    waitpid(pid, &status, 0);
-    std::filesystem::remove_all(dir);
+    shell("ip netns del " + netns);
     return 0;
 }

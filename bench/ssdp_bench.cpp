@@ -14,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "BenchSupport.h"
 #include "core/Json.h"
 #include "core/Utils.h"
 #include "discovery/Base64.h"
@@ -24,23 +25,10 @@ namespace {
 
 using kesu::Json;
 
-// A phone announcement as it travels on the LAN.
-std::string announcement(const std::string& id) {
-    const Json body{{"deviceName", "kesu Mate Phone 60 Pro"},
-                    {"deviceId", id},
-                    {"openId", "5f2c9e7a1d3b4c6e8f0a2b4c6d8e0f12"},
-                    {"account", "138****5678"},
-                    {"deviceType", "mobile"},
-                    {"pcCustomizedData", "1"},
-                    {"serviceRecord", "com.kesu.pcsuite.SERVICE--com.kesu.share.CONNECT_PC"},
-                    {"port", 10191},
-                    {"extra", "null"}};
-    return "RESPONSE * HTTP/1.1\r\nDATE:2024-05-01 10:00:00.000\r\ncompatGsonStr:" +
-           kesu::base64::encode(kesu::json::compact(body)) + "\r\n";
-}
+using kesu::bench::phoneAnnouncement;
 
 void BM_Baseline_Memcpy(benchmark::State& state) {
-    const std::string datagram = announcement("AB12CD34EF56");
+    const std::string datagram = phoneAnnouncement("AB12CD34EF56");
     std::vector<char> buffer(datagram.size());
     for (auto _ : state) {
         std::memcpy(buffer.data(), datagram.data(), datagram.size());
@@ -52,7 +40,7 @@ void BM_Baseline_Memcpy(benchmark::State& state) {
 BENCHMARK(BM_Baseline_Memcpy);
 
 void BM_Baseline_Base64JsonParse(benchmark::State& state) {
-    const std::string datagram = announcement("AB12CD34EF56");
+    const std::string datagram = phoneAnnouncement("AB12CD34EF56");
     const std::string payload = datagram.substr(datagram.find("compatGsonStr:") + 14, std::string::npos);
     const std::string b64 = payload.substr(0, payload.size() - 2);
     for (auto _ : state) {
@@ -67,7 +55,7 @@ BENCHMARK(BM_Baseline_Base64JsonParse);
 // Steady state: the same device re-announcing (classify, decode, parse, refresh).
 void BM_Announcement_Refresh(benchmark::State& state) {
     kesu::SsdpDeviceManager table;
-    const std::string datagram = announcement("AB12CD34EF56");
+    const std::string datagram = phoneAnnouncement("AB12CD34EF56");
     for (auto _ : state) {
         benchmark::DoNotOptimize(kesu::SsdpMessage::handleDatagram(datagram, "192.168.1.20", table));
     }
@@ -84,7 +72,7 @@ void BM_Announcement_DistinctIdsFullTable(benchmark::State& state) {
     for (int i = 0; i < 4096; ++i) {
         char head[8];
         std::snprintf(head, sizeof head, "%04x", i);
-        datagrams.push_back(announcement(std::string(head) + "-5F2C9E"));
+        datagrams.push_back(phoneAnnouncement(std::string(head) + "-5F2C9E"));
     }
     std::size_t i = 0;
     for (auto _ : state) {

@@ -1,0 +1,256 @@
+// Connections to a phone against the real binary, across a veth link between two network
+// namespaces (the service on 10.77.8.1, an in-process phone on 10.77.8.2):
+//  - connectSSDP round trip with a phone that accepts at once, next to a raw TCP exchange on
+//    the same link (connect, send a request-sized frame, read the echo, close) and the
+//    control API's HeartBeat, measured in the same run;
+//  - the time from a phone's announcement leaving the phone to its appearance in the answer
+//    of SSDPQueryAll, next to the SSDPQueryAll round trip itself (the resolution).
+//
+//   build-bench/bench/connect_bench [connects=300] [announcements=100]      (root)
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
+#include <poll.h>
+#include <sched.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstdio>
+#include <cstdlib>
+#include <functional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "BenchSupport.h"
+#include "connect/PhoneFrame.h"
+
+namespace {
+
+using namespace kesu::bench;
+using kesu::Json;
+
+const char* const kPhoneNs = "kesubench-phone";
+const char* const kPcIp = "10.77.8.1";
+const char* const kPhoneIp = "10.77.8.2";
+constexpr int kEchoPort = 10192;
+
+const char* const kPcNs = "kesubench-pc";
+
+// This process in a namespace of its own, joined to the phone's namespace by a veth pair.
+bool buildNetwork() {
+    shell(std::string("ip netns del ") + kPhoneNs);
+    const std::string n = std::string("ip -n ") + kPhoneNs + " ";
+    return enterNewNamespace(kPcNs) && shell(std::string("ip netns add ") + kPhoneNs) &&
+           shell(std::string("ip link add kb0 type veth peer name kb1 netns ") + kPhoneNs) &&
+           shell(std::string("ip addr add ") + kPcIp + "/24 dev kb0") && shell("ip link set kb0 up") &&
+           shell("ip route add 224.0.0.0/4 dev kb0") && shell(n + "link set lo up") &&
+           shell(n + "addr add " + kPhoneIp + "/24 dev kb1") && shell(n + "link set kb1 up") &&
+           shell(n + "route add 224.0.0.0/4 dev kb1");
+}
+
+// Runs `fn` on a thread that entered the phone's namespace (sockets made there stay there).
+void inPhoneNamespace(const std::function<void()>& fn) {
+    std::thread([&] {
+        const int fd = ::open((std::string("/run/netns/") + kPhoneNs).c_str(), O_RDONLY | O_CLOEXEC);
+        if (fd >= 0 && ::setns(fd, CLONE_NEWNET) == 0) fn();
+        if (fd >= 0) ::close(fd);
+    }).join();
+}
+
+int listenOn(int port) {
+    const int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    int one = 1;
+    ::setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
+    sockaddr_in a{};
+    a.sin_family = AF_INET;
+    a.sin_port = htons(static_cast<uint16_t>(port));
+    ::inet_pton(AF_INET, kPhoneIp, &a.sin_addr);
+    if (::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0 || ::listen(fd, 16) != 0) return -1;
+    return fd;
+}
+
+bool writeAll(int fd, const kesu::Bytes& bytes) {
+    for (std::size_t off = 0; off < bytes.size();) {
+        const ssize_t n = ::send(fd, bytes.data() + off, bytes.size() - off, MSG_NOSIGNAL);
+        if (n <= 0) return false;
+        off += static_cast<std::size_t>(n);
+    }
+    return true;
+}
+
+// The phone's side of each link on `listener`: read one whole frame, answer with `answer`
+// (or, when empty, echo the frame), then wait for the peer to close. Ends when the listener
+// is shut down.
+void servePhone(int listener, const kesu::Bytes& answer) {
+    for (;;) {
+        const int c = ::accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
+        if (c < 0) return;
+        int one = 1;
+        ::setsockopt(c, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
+        kesu::FrameCutter cutter{1 << 20};
+        char buf[4096];
+        ssize_t n;
+        bool answered = false;
+        while ((n = ::recv(c, buf, sizeof buf, 0)) > 0) {
+            cutter.feed(std::string_view(buf, static_cast<std::size_t>(n)));
+            if (auto frame = cutter.next(); frame && !answered) answered = writeAll(c, answer.empty() ? *frame : answer);
+        }
+        ::close(c);
+    }
+}
+
+// Raw baseline: a new TCP link to the phone, one request-sized frame out and back, close.
+double rawExchange(const kesu::Bytes& frame) {
+    const auto t0 = Clock::now();
+    const int s = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    int one = 1;
+    ::setsockopt(s, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
+    sockaddr_in a{};
+    a.sin_family = AF_INET;
+    a.sin_port = htons(kEchoPort);
+    ::inet_pton(AF_INET, kPhoneIp, &a.sin_addr);
+    if (::connect(s, reinterpret_cast<sockaddr*>(&a), sizeof a) == 0 && writeAll(s, frame)) {
+        std::vector<char> buf(frame.size());
+        std::size_t got = 0;
+        ssize_t n;
+        while (got < frame.size() && (n = ::recv(s, buf.data() + got, frame.size() - got, 0)) > 0)
+            got += static_cast<std::size_t>(n);
+    }
+    ::close(s);
+    return micros(Clock::now() - t0);
+}
+
+void report(const char* what, const std::vector<double>& v) {
+    std::printf("%-58s p50 %9.1f us  p99 %9.1f us  (n=%zu)\n", what, percentile(v, 0.5), percentile(v, 0.99),
+                v.size());
+}
+
+void ratio(const char* what, const std::vector<double>& a, const std::vector<double>& b) {
+    std::printf("%-58s p50 %8.2fx   p99 %8.2fx\n", what, percentile(a, 0.5) / percentile(b, 0.5),
+                percentile(a, 0.99) / percentile(b, 0.99));
+}
+
+// The table id the service gives an announced id: the hex of its first four characters.
+std::string tableId(const std::string& id) {
+    static const char* digits = "0123456789abcdef";
+    std::string out;
+    for (unsigned char c : id.substr(0, 4)) out += {digits[c >> 4], digits[c & 15]};
+    return out;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    const int connects = argc > 1 ? std::atoi(argv[1]) : 300;
+    const int announcements = argc > 2 ? std::atoi(argv[2]) : 100;
+    if (!buildNetwork()) {
+        std::fprintf(stderr, "connect_bench needs root for network namespaces\n");
+        return 1;
+    }
+    int phoneListener = -1, echoListener = -1, udp = -1;
+    inPhoneNamespace([&] {
+        phoneListener = listenOn(10191);
+        echoListener = listenOn(kEchoPort);
+        udp = ::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+        in_addr iface{};
+        ::inet_pton(AF_INET, kPhoneIp, &iface);
+        ::setsockopt(udp, IPPROTO_IP, IP_MULTICAST_IF, &iface, sizeof iface);
+    });
+    if (phoneListener < 0 || echoListener < 0 || udp < 0) {
+        std::fprintf(stderr, "phone sockets could not be set up\n");
+        return 1;
+    }
+    std::thread phone(servePhone, phoneListener, kesu::buildPhoneFrameFromJson(Json{{"bytes", {1}}}));
+    std::thread echo(servePhone, echoListener, kesu::Bytes{});
+
+    int status = 1;
+    {
+        BenchService service(kPcNs);
+        if (!service.waitUntilUp()) {
+            std::fprintf(stderr, "service did not answer\n");
+        } else {
+            sockaddr_in group{};
+            group.sin_family = AF_INET;
+            group.sin_port = htons(2200);
+            ::inet_pton(AF_INET, "239.255.255.250", &group.sin_addr);
+            const auto announce = [&](const std::string& id) {
+                const std::string datagram = phoneAnnouncement(id);
+                ::sendto(udp, datagram.data(), datagram.size(), 0, reinterpret_cast<sockaddr*>(&group), sizeof group);
+            };
+            const std::string queryAll = controlBody("SSDPQueryAll");
+
+            // Announcement to table: a new id each round, then SSDPQueryAll back to back until
+            // it shows.
+            std::vector<double> appear, query;
+            for (int i = 0; i < announcements; ++i) {
+                char id[32];
+                std::snprintf(id, sizeof id, "Q%03d-BENCH", i);
+                const std::string wanted = "\"" + tableId(id) + "\"";
+                const auto t0 = Clock::now();
+                announce(id);
+                for (;;) {
+                    const auto q0 = Clock::now();
+                    const auto answer = service.control(queryAll);
+                    query.push_back(micros(Clock::now() - q0));
+                    if (answer && answer->find(wanted) != std::string::npos) break;
+                    if (Clock::now() - t0 > std::chrono::seconds(5)) {
+                        std::fprintf(stderr, "announcement %s never appeared\n", id);
+                        break;
+                    }
+                }
+                appear.push_back(micros(Clock::now() - t0));
+            }
+
+            // connectSSDP to a phone that accepts at once.
+            const std::string phoneId = "CONNECT-BENCH";
+            const std::string connectBody = controlBody("connectSSDP", Json::array({tableId(phoneId)}));
+            const kesu::Bytes requestSized = kesu::buildPhoneFrameFromJson(
+                Json{{"bytes", {0}}, {"deviceName", "bench-pc"}, {"channel", 0}, {"id", 87654321},
+                     {"open_Id", "5f2c9e7a1d3b4c6e8f0a2b4c6d8e0f12"}, {"service_id", "com.kesu.pcsuite.SERVICE"},
+                     {"target_id", "02:42:ac:11:00:02"}, {"account", "138****5678"}, {"type", 1}});
+            std::vector<double> connect, raw, heartbeat;
+            int failures = 0;
+            for (int i = 0; i < connects; ++i) {
+                if (i % 50 == 0) {  // keep the phone well inside the 30 s expiry
+                    announce(phoneId);
+                    const auto t0 = Clock::now();
+                    while (Clock::now() - t0 < std::chrono::seconds(5)) {
+                        const auto answer = service.control(queryAll);
+                        if (answer && answer->find("\"" + tableId(phoneId) + "\"") != std::string::npos) break;
+                    }
+                }
+                const auto t0 = Clock::now();
+                const auto answer = service.control(connectBody);
+                connect.push_back(micros(Clock::now() - t0));
+                if (!answer || answer->find("\"error\":0") == std::string::npos) ++failures;
+                raw.push_back(rawExchange(requestSized));
+                const auto h0 = Clock::now();
+                service.control(controlBody("HeartBeat"));
+                heartbeat.push_back(micros(Clock::now() - h0));
+            }
+
+            report("connectSSDP round trip (phone accepts at once)", connect);
+            report("raw TCP: connect + frame out and back + close (same link)", raw);
+            report("HeartBeat round trip (control API floor)", heartbeat);
+            ratio("ratio connectSSDP / raw TCP exchange", connect, raw);
+            std::vector<double> floor;
+            for (std::size_t i = 0; i < raw.size(); ++i) floor.push_back(raw[i] + heartbeat[i]);
+            ratio("ratio connectSSDP / (raw TCP exchange + HeartBeat)", connect, floor);
+            std::printf("connectSSDP failures: %d of %d\n", failures, connects);
+            report("announcement sent -> present in SSDPQueryAll", appear);
+            report("SSDPQueryAll round trip (resolution of the above)", query);
+            ratio("ratio appearance / SSDPQueryAll round trip", appear, query);
+            status = failures == 0 ? 0 : 2;
+        }
+    }
+    ::shutdown(phoneListener, SHUT_RDWR);
+    ::shutdown(echoListener, SHUT_RDWR);
+    phone.join();
+    echo.join();
+    shell(std::string("ip netns del ") + kPhoneNs);
+    shell(std::string("ip netns del ") + kPcNs);
+    return status;
+}
