@@ -212,7 +212,15 @@ bool PhoneLink::writeAll(const Bytes& data, Clock::time_point deadline, std::str
         if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
             const Wait wait = waitFor(POLLOUT, deadline);
             if (wait == Wait::Ready) continue;
-            error = wait == Wait::TimedOut ? "write timed out" : "closed while writing";
+            if (wait == Wait::Woken) {
+                error = "closed while writing";
+            } else if (sent == 0) {
+                error = "write timed out";
+            } else {
+                error = "sent only " + std::to_string(sent) + " of " + std::to_string(data.size()) +
+                        " bytes in time, closing the link";
+                shut();
+            }
             return false;
         }
         error = n < 0 ? errnoText(errno) : "nothing written";
@@ -240,7 +248,14 @@ PhoneLink::Read PhoneLink::readFrame(Bytes& frame, Clock::time_point deadline) {
             return Read::Frame;
         }
         if (shut_.load()) return Read::Shut;
-        if (peerClosed_) return Read::Closed;
+        if (peerClosed_) {
+            if (const std::size_t rest = cutter_.buffered(); rest > 0) {
+                Utils::mPrintlog("[PhoneLink::readFrame] " + peerAddress() + " dropped " + std::to_string(rest) +
+                                 " bytes of an unfinished frame");
+                cutter_.clear();
+            }
+            return Read::Closed;
+        }
         const ssize_t n = ::recv(fd_, chunk.data(), chunk.size(), 0);
         if (n > 0) {
             cutter_.feed(chunk.data(), static_cast<std::size_t>(n));
@@ -257,6 +272,7 @@ PhoneLink::Read PhoneLink::readFrame(Bytes& frame, Clock::time_point deadline) {
             if (wait == Wait::Ready) continue;
             return wait == Wait::TimedOut ? Read::TimedOut : Read::Shut;
         }
+        readError_ = errnoText(errno);
         peerClosed_ = true;
         connected_ = false;
     }

@@ -29,7 +29,8 @@ public:
     // Connects to ip:port (a numeric IPv4 or IPv6 address) before the deadline. False with
     // `error` filled when refused, unreachable, timed out or shut meanwhile.
     bool connect(const std::string& ip, std::uint16_t port, Clock::time_point deadline, std::string& error);
-    // Writes all of `data` before the deadline.
+    // Writes all of `data` before the deadline. A write the deadline cuts short would leave half
+    // a frame on the wire for the peer to misread, so the link is shut then.
     bool writeAll(const Bytes& data, Clock::time_point deadline, std::string& error);
 
     enum class Read {
@@ -39,8 +40,11 @@ public:
         Shut,      // shut() was called
     };
     // Waits for the next whole phone frame. Bytes that cannot start a frame are dropped (with
-    // a log line); the buffer is bounded by Config::phoneFrameMaxBody.
+    // a log line); the buffer is bounded by Config::phoneFrameMaxBody. Frames that arrived
+    // before the peer closed are handed out before Closed.
     Read readFrame(Bytes& frame, Clock::time_point deadline);
+    // Why readFrame gave Closed: "" for the peer's orderly close, else the error. Reading thread only.
+    const std::string& readError() const { return readError_; }
 
     // Ends the link for every user; safe from any thread, repeated calls do nothing. The
     // descriptors are closed by the destructor only, so no waiting thread ever polls a
@@ -73,6 +77,7 @@ private:
     // Used by the one reading thread only.
     FrameCutter cutter_;
     bool peerClosed_ = false;
+    std::string readError_;
 };
 
 }  // namespace kesu

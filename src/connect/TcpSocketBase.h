@@ -41,6 +41,7 @@ private:
     struct Link;
     std::shared_ptr<Link> currentLink() const;
     std::shared_ptr<Link> takeLink();
+    bool detach(const std::shared_ptr<Link>& link);  // true if `link` was the current one
 
     std::mutex initialMutex_;  // one connect at a time
     mutable std::mutex mutex_;

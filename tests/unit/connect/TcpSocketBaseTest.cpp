@@ -221,6 +221,20 @@ TEST(TcpSocketBase, BlockedReaderWakesOnPeerCloseAndOnLocalClose) {
     EXPECT_EQ(got.errorCode, -1);
     EXPECT_LT(got.took, kWellBeforeLongWait);
 
+    // The peer resets the link while the reader waits: the same end as a close.
+    ASSERT_TRUE(socket.initial(listener.port(), "127.0.0.1", 3));
+    peer = listener.accept();
+    reader = recvAsync(socket, kLongWait);
+    letThreadBlock();
+    const linger reset{1, 0};
+    ::setsockopt(peer.get(), SOL_SOCKET, SO_LINGER, &reset, sizeof reset);
+    peer.reset();
+    got = reader.get();
+    EXPECT_FALSE(got.ok);
+    EXPECT_EQ(got.errorCode, -1);
+    EXPECT_FALSE(socket.isConnected());
+    EXPECT_FALSE(socket.sendMsg(1.0, buildPhoneFrame("{}")));
+
     // This side closes from another thread while the reader waits; the same object then
     // connects again.
     ASSERT_TRUE(socket.initial(listener.port(), "127.0.0.1", 3));
