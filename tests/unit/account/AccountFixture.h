@@ -1,5 +1,5 @@
 // Shared set-up of the account tests: a hermetic home with the PC suite's folders, real
-// Config.db files written through SQLite, and access to the day's log file.
+// Config.db files written through SQLite, and the rows of a signed-in account.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -11,8 +11,15 @@
 #include "account/DataInstance.h"
 #include "core/Utils.h"
 #include "support/TestSupport.h"
+#include "unit/UnitHelpers.h"
 
 namespace kesu::test {
+
+// One signed-in account; its directories are the second SoftwareSet row, not the last one.
+inline const std::string kSignedInRows =
+    "INSERT INTO User VALUES ('oid-1', '13812345678', 'tok-SECRET-1');"
+    "INSERT INTO SoftwareSet VALUES ('oid-other', '/cfg/other', '/store/other');"
+    "INSERT INTO SoftwareSet VALUES ('oid-1', '/cfg/one', '/store/one');";
 
 class AccountFixture : public ::testing::Test {
 protected:
@@ -20,11 +27,18 @@ protected:
         dataInstance().update([](databaseParam& p) { p = databaseParam{}; });
         std::filesystem::create_directories(dbDir());
     }
-    void TearDown() override { dataInstance().update([](databaseParam& p) { p = databaseParam{}; }); }
+    void TearDown() override {
+        dataInstance().update([](databaseParam& p) { p = databaseParam{}; });
+        Utils::closeLog();
+    }
 
     std::string supportDir() const { return env.home() + "/Library/Application Support/pcsuite"; }
     std::string dbDir() const { return supportDir() + "/DataBase"; }
     std::string dbFile() const { return dbDir() + "/Config.db"; }
+    // Writes a file below the PC suite's support folder.
+    void writeSupportFile(const std::string& name, const std::string& content) {
+        env.dir().write("home/Library/Application Support/pcsuite/" + name, content);
+    }
 
     // Creates the file anew with both tables, then runs `rows` (INSERT statements).
     static void writeDatabase(const std::string& path, const std::string& rows) {
@@ -42,9 +56,6 @@ protected:
         sqlite3_close(db);
         ASSERT_EQ(rc, SQLITE_OK) << message;
     }
-
-    // Everything logged today so far.
-    static std::string logText() { return readAll(Utils::logFilePath(Utils::now())); }
 
     HermeticEnv env;
 };

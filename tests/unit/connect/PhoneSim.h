@@ -1,7 +1,10 @@
-// Test peers of the phone connections: a simulated phone that listens on a loopback port and
-// speaks the frame protocol (answers, stays silent or hangs up), and a stand-in for a launched
-// program that reports its arguments back to the test over loopback.
+// Test peers of the phone connections: the PC's identity as phones see it (a fixture), a
+// simulated phone that listens on a loopback port and speaks the frame protocol (answers,
+// stays silent or hangs up), and a stand-in for a launched program that reports its
+// arguments back to the test over loopback.
 #pragma once
+
+#include <gtest/gtest.h>
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
@@ -19,9 +22,53 @@
 #include <thread>
 #include <vector>
 
+#include "account/DataInstance.h"
 #include "connect/PhoneFrame.h"
+#include "core/Json.h"
+#include "core/Utils.h"
+#include "platform/fake/FakePlatform.h"
+#include "support/TestSupport.h"
 
 namespace kesu::test {
+
+// The PC every connection test talks for: host "Office-Desk-PC" (sent as "Off****-PC"), a
+// Wi-Fi adapter aa:bb:cc:dd:ee:ff and a signed-in account.
+class PcIdentityTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        Utils::resetStateForTest();
+        fake->setLocalizedHostName("Office-Desk-PC");
+        fake->addAdapter("Wi-Fi", "wlan0", "aa:bb:cc:dd:ee:ff", "192.168.1.2");
+        dataInstance().update([](databaseParam& p) {
+            p = databaseParam();
+            p.openid = "openid-of-pc";
+            p.Phone = "138****5678";
+        });
+    }
+    void TearDown() override {
+        dataInstance().update([](databaseParam& p) { p = databaseParam(); });
+        Utils::resetStateForTest();
+        Utils::closeLog();
+    }
+
+    // The PC's connection request, exactly as sent.
+    static Json pcRequest() {
+        return {{"bytes", {0}},          {"deviceName", "Off****-PC"},        {"channel", 0},
+                {"id", 87654321},        {"open_Id", "openid-of-pc"},         {"service_id", "com.kesu.pcsuite.SERVICE"},
+                {"target_id", "aabbccddeeff"}, {"account", "138****5678"}, {"type", 1}};
+    }
+    // The PC's answer to a phone: the same identity, the tag, the service and "type" as text.
+    static Json pcAnswer(int tag, const std::string& service = "com.kesu.pcsuite.SERVICE") {
+        Json answer = pcRequest();
+        answer["bytes"] = {tag};
+        answer["service_id"] = service;
+        answer["type"] = "1";
+        return answer;
+    }
+
+    HermeticEnv env;
+    ScopedFakePlatform fake;
+};
 
 // A listening socket on 127.0.0.1, an ephemeral port.
 inline int listenLoopback(int& port) {

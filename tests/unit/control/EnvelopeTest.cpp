@@ -28,35 +28,27 @@ TEST(Envelope, LengthPrefixIsOptionalAndIgnored) {
     EXPECT_EQ(decode("###").event, RequestEvent::unknown);
 }
 
-TEST(Envelope, CmdFormTakesParamNeverArgs) {
+TEST(Envelope, CmdFormParamsByJsonTypeAndAppOnlyWhenString) {
     const requestObj a = decode(R"({"cmd":"queryAdapter","param":{}})");
-    const requestObj b = decode(R"({"event":"queryAdapter","args":{}})");
-    EXPECT_EQ(a.event, b.event);
-    EXPECT_EQ(a.params, b.params);
+    EXPECT_EQ(a.event, RequestEvent::queryAdapter);
     EXPECT_TRUE(a.params.is_object());
-
+    // "cmd" takes "param", never "args".
     const requestObj c = decode(R"({"event":"","cmd":"HeartBeat","args":{"x":1}})");
     EXPECT_EQ(c.event, RequestEvent::HeartBeat);
     EXPECT_EQ(c.params, Json::array());
-}
 
-TEST(Envelope, ParamsByJsonTypeAndAppOnlyWhenString) {
     EXPECT_EQ(decode(R"({"event":"kpush","args":"text"})").params, Json("text"));
-    EXPECT_EQ(decode(R"({"event":"kpush","args":[1,"2"]})").params, Json::parse(R"([1,"2"])"));
     EXPECT_EQ(decode(R"({"event":"kpush","args":5})").params, Json::array());
     EXPECT_EQ(decode(R"({"event":"kpush","args":null})").params, Json::array());
-    EXPECT_EQ(decode(R"({"event":"kpush"})").params, Json::array());
     EXPECT_FALSE(decode(R"({"event":"kpush","app":7})").sourec.has_value());
-    EXPECT_FALSE(decode(R"({"event":"kpush"})").sourec.has_value());
 }
 
 TEST(Envelope, EventNamesMatchExactly) {
     EXPECT_EQ(decode(R"({"event":"preconnect_preconnect-connect"})").event,
               RequestEvent::preconnect_preconnect_connect);
-    EXPECT_EQ(decode(R"({"event":"preconnect_preconnect_connect"})").event, RequestEvent::unknown);
-    EXPECT_EQ(decode(R"({"event":"heartbeat"})").event, RequestEvent::unknown);
-    EXPECT_EQ(decode(R"({"event":" HeartBeat"})").event, RequestEvent::unknown);
-    EXPECT_EQ(decode(R"({"event":42})").event, RequestEvent::unknown);
+    for (const char* other : {R"({"event":"preconnect_preconnect_connect"})", R"({"event":"heartbeat"})",
+                              R"({"event":" HeartBeat"})", R"({"event":42})"})
+        EXPECT_EQ(decode(other).event, RequestEvent::unknown) << other;
     // Every wire name decodes to its own case.
     for (RequestEvent e : allValues()) {
         Json envelope = {{"event", std::string(rawValue(e))}};
@@ -86,36 +78,12 @@ TEST(Envelope, BodyBytesDropFFAndRejectInvalidUtf8) {
 
 TEST(Envelope, AnswersAreCountedInUserPerceivedCharacters) {
     EXPECT_EQ(text::lengthPrefixed(""), "");
-    const std::string ascii(42, 'a');
-    EXPECT_EQ(text::lengthPrefixed(ascii), "42#" + ascii);
     // 你好 is 2 characters in 6 bytes; a family emoji joined by ZWJ is one character.
     EXPECT_EQ(text::lengthPrefixed("\xe4\xbd\xa0\xe5\xa5\xbd"), "2#\xe4\xbd\xa0\xe5\xa5\xbd");
     const std::string family = "\xf0\x9f\x91\xa8\xe2\x80\x8d\xf0\x9f\x91\xa9\xe2\x80\x8d\xf0\x9f\x91\xa7";
     EXPECT_EQ(text::lengthPrefixed("{" + family + "}"), "3#{" + family + "}");
-    // "e" + combining acute accent is one character.
-    EXPECT_EQ(text::graphemeCount("e\xcc\x81"), 1u);
+    EXPECT_EQ(text::graphemeCount("e\xcc\x81"), 1u);  // "e" + combining acute accent
 }
-
-TEST(Dispatcher, HeartbeatAndEmptyAnswers) {
-    const std::string answer = HttpService::handleBody(R"({"event":"HeartBeat","args":[]})");
-    const auto hash = answer.find('#');
-    ASSERT_NE(hash, std::string::npos);
-    const Json body = Json::parse(answer.substr(hash + 1));
-    EXPECT_EQ(body, Json({{"error", 0}, {"error_message", ""}, {"data", "Alive"}}));
-    EXPECT_EQ(answer.substr(0, hash), std::to_string(answer.size() - hash - 1));
-
-    for (const char* event : {"queryAll", "stopSSDPScan", "openWifi", "unknown", "LaunchSuccess", "AlreadyStart",
-                              "noSuchEvent"}) {
-        EXPECT_EQ(HttpService::handleBody(Json({{"event", event}}).dump()), "") << event;
-    }
-    EXPECT_EQ(HttpService::handleBody(""), "");
-}
-
-}  // namespace
-}  // namespace kesu
-
-namespace kesu {
-namespace {
 
 TEST(ControlServer, StopRightAfterStartDoesNotHang) {
     test::HermeticEnv env;

@@ -27,10 +27,7 @@ TEST(SingleInstance, CountsExactlyTwoMatchingLines) {
     const std::string other = "   1234 ?        00:00:09 KesuConnService\n";
     const std::string grep = "   5555 pts/0    00:00:00 grep KesuConnService\n";
     EXPECT_EQ(countProcessLines(header, "KesuConnService"), 0);
-    EXPECT_EQ(countProcessLines(header + self, "KesuConnService"), 1);
-    EXPECT_EQ(countProcessLines(header + self + other, "KesuConnService"), 2);
-    EXPECT_EQ(countProcessLines(header + self + other + grep, "KesuConnService"), 2);
-    EXPECT_EQ(countProcessLines(header + self + other + other, "KesuConnService"), 3);
+    EXPECT_EQ(countProcessLines(header + self + other + grep, "KesuConnService"), 2);  // grep itself is not one
     // Last line without a newline still counts.
     EXPECT_EQ(countProcessLines("1 ? 0 KesuConnService", "KesuConnService"), 1);
 }
@@ -58,7 +55,7 @@ protected:
     test::HermeticEnv env;
 };
 
-TEST_F(RestartRule, RestartsAfterMoreThanSevenWholeDays) {
+TEST_F(RestartRule, RestartsAfterMoreThanSevenWholeDaysOfAUsableVersionFile) {
     RestartServiceSubscriber subscriber;
     versionUpdated("2026-11-26 10:00:00.000");
     now("2026-12-03 10:00:00.000");  // exactly 7 days
@@ -70,12 +67,11 @@ TEST_F(RestartRule, RestartsAfterMoreThanSevenWholeDays) {
     // A version file from the future is not out of date.
     now("2026-11-01 10:00:00.000");
     EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
-}
 
-TEST_F(RestartRule, UnusableVersionFileCountsAsCurrent) {
-    RestartServiceSubscriber subscriber;
+    // A missing or unusable version file counts as current.
     now("2026-12-04 10:00:00.000");
-    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());  // missing
+    std::filesystem::remove(rootedPath(Config::current().versionFile));
+    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
     for (const std::string& content :
          {std::string(""), std::string("not json"), std::string(R"({"version":"3.6.1.0"})"),
           std::string(R"({"updateTime":"2020-01-01"})"), std::string(R"({"updateTime":12345})"),

@@ -1,5 +1,6 @@
 // Shared set-up of the discovery tests: a hermetic home for the log, the fake platform with
-// a known host name, a clock the test moves by hand, and the signed-in account's open id.
+// a known host name and settable adapters, a clock the test moves by hand, the signed-in
+// account's open id, and phones' announcements.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -7,13 +8,39 @@
 #include <atomic>
 #include <chrono>
 #include <string>
+#include <vector>
 
 #include "account/DataInstance.h"
+#include "core/Json.h"
 #include "core/Utils.h"
+#include "discovery/Base64.h"
 #include "platform/fake/FakePlatform.h"
 #include "support/TestSupport.h"
+#include "unit/UnitHelpers.h"
 
 namespace kesu::test {
+
+// A phone's announcement body (current format) as phones send it.
+inline Json phoneBody(const std::string& id, const std::string& account = "138****0000",
+                      const std::string& name = "kesu X1 Pro") {
+    return Json{{"deviceName", name},    {"deviceId", id},          {"openId", "openid-of-this-pc"},
+                {"account", account},    {"deviceType", "mobile"},  {"pcCustomizedData", "G1"},
+                {"serviceRecord", "com.kesu.pcsuite.SERVICE--com.kesu.share.CONNECT_PC"}};
+}
+
+// The datagram around an announcement body.
+inline std::string announce(const Json& body) {
+    return "RESPONSE * HTTP/1.1\r\nDATE:2024-05-01 10:00:00.000\r\ncompatGsonStr:" +
+           base64::encode(json::compact(body)) + "\r\n";
+}
+
+// One adapter of the fake machine; an empty ip is an adapter without an address.
+struct Adapter {
+    std::string kind;
+    std::string name;
+    std::string ip;
+    std::string netmask = "255.255.255.0";
+};
 
 class DiscoveryTest : public ::testing::Test {
 protected:
@@ -38,7 +65,18 @@ protected:
 
     void advance(double s) { seconds_.store(seconds_.load() + s); }
     double now() const { return seconds_.load(); }
-    std::string todaysLog() const { return readAll(Utils::logFilePath(Utils::now())); }
+
+    // Replaces the fake machine's adapters and their addresses.
+    void network(const std::vector<Adapter>& adapters) {
+        std::vector<NetworkService> services;
+        std::vector<InterfaceAddress> addresses;
+        for (const Adapter& a : adapters) {
+            services.push_back({a.kind, a.name, "02:00:00:00:00:0" + std::to_string(services.size())});
+            if (!a.ip.empty()) addresses.push_back({a.name, a.ip, a.netmask, true});
+        }
+        fake->setNetworkServices(services);
+        fake->setInterfaceAddresses(addresses);
+    }
 
     HermeticEnv env;
     ScopedFakePlatform fake;

@@ -5,10 +5,7 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <net/if.h>
-#include <netinet/in.h>
 #include <sched.h>
-#include <sys/socket.h>
-#include <unistd.h>
 
 #include <condition_variable>
 #include <future>
@@ -17,10 +14,7 @@
 #include <thread>
 
 #include "DiscoveryFixture.h"
-#include "control/HttpService.h"
-#include "core/Json.h"
 #include "core/Process.h"
-#include "discovery/Base64.h"
 #include "discovery/KesuAdapterManager.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/SsdpMessage.h"
@@ -70,25 +64,9 @@ private:
     std::vector<Heard> heard_;
 };
 
-int freeUdpPort() {
-    const int fd = ::socket(AF_INET, SOCK_DGRAM, 0);
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t length = sizeof address;
-    ::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address);
-    ::getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length);
-    ::close(fd);
-    return ntohs(address.sin_port);
-}
-
 // A phone's announcement in the current format.
 std::string phoneAnnouncement(const std::string& id, const std::string& name) {
-    const Json body{{"deviceName", name},     {"deviceId", id},          {"openId", "phone-open-id"},
-                    {"account", "138****5678"}, {"deviceType", "mobile"}, {"pcCustomizedData", "1"},
-                    {"serviceRecord", "com.kesu.pcsuite.SERVICE--com.kesu.share.CONNECT_PC"}};
-    return "RESPONSE * HTTP/1.1\r\nDATE:2024-05-01 10:00:00.000\r\ncompatGsonStr:" +
-           base64::encode(json::compact(body)) + "\r\n";
+    return test::announce(test::phoneBody(id, "138****5678", name));
 }
 
 // A phone on this machine: sends to the group over the loopback interface from 127.0.0.1.
@@ -119,12 +97,7 @@ private:
     int port_;
 };
 
-Json queryAll() {
-    const std::string answer = HttpService::handleBody(R"({"event":"SSDPQueryAll","args":[]})");
-    const auto hash = answer.find('#');
-    if (hash == std::string::npos) return Json();
-    return json::parse(answer.substr(hash + 1)).value_or(Json());
-}
+Json queryAll() { return test::control("SSDPQueryAll")["data"]; }
 
 class SsdpSocketTest : public test::DiscoveryTest {
 protected:
@@ -135,7 +108,7 @@ protected:
 };
 
 TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
-    env.config().ssdpPort = freeUdpPort();
+    env.config().ssdpPort = test::freeUdpPort();
     env.config().ssdpMaxDatagram = 1024;
     Recorder pcHeard(/*classify=*/true);
     SsdpSocketManager pc(pcHeard.receiver());
@@ -146,14 +119,12 @@ TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
     ASSERT_TRUE(socket->isReceiving());
     EXPECT_TRUE(socket->isBoundToDevice());
     EXPECT_EQ(socket->localPort(), env.config().ssdpPort);
-    EXPECT_NE(todaysLog().find("[SsdpSocket::initSocket] bind success"), std::string::npos);
-    EXPECT_NE(todaysLog().find("[SsdpSocket::initSocket] beginReceiving success"), std::string::npos);
 
     // A phone's announcement lands in the table and in the control API's answer.
     LoopbackPhone phone(env.config().ssdpPort);
     ASSERT_TRUE(phone.send(phoneAnnouncement("AB12CD34", "kesu X1 Pro")));
     ASSERT_EQ(pcHeard.waitFor(1).size(), 1u);
-    Json devices = queryAll()["data"];
+    Json devices = queryAll();
     ASSERT_EQ(devices.size(), 1u);
     EXPECT_EQ(devices[0]["deviceId"], "41423132");
     EXPECT_EQ(devices[0]["deviceName"], "X1 Pro");
@@ -167,9 +138,6 @@ TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
     auto heard = pcHeard.waitFor(2);
     ASSERT_EQ(heard.size(), 2u);
     EXPECT_EQ(heard[1].data, "");
-    EXPECT_NE(todaysLog().find("[SsdpSocket::udpSocket] datagram of 1500 bytes is longer than 1024, dropped"),
-              std::string::npos);
-    EXPECT_NE(todaysLog().find("[ssdpSocket::udpSocket] data is nil ...\n"), std::string::npos);
 
     // The PC's own announcement comes back on its socket: it refreshes the own-echo time
     // stamp and is not stored.
@@ -181,16 +149,7 @@ TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
     EXPECT_TRUE(heard[2].data.starts_with("RESPONSE * HTTP/1.1\r\nDATE:"));
     EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
 
-    // The search message goes out as built and is ignored on arrival.
-    ASSERT_TRUE(pc.sendSearchData("pc-id", "open-id", "svc"));
-    heard = pcHeard.waitFor(4);
-    ASSERT_EQ(heard.size(), 4u);
-    EXPECT_EQ(heard[3].data, SsdpMessage::searchMessage("pc-id", "open-id", "svc"));
-    EXPECT_EQ(queryAll()["data"].size(), 1u);
-
-    EXPECT_FALSE(socket->sendMsg(std::string("\xff\xfe")));
-    EXPECT_NE(todaysLog().find("[SsdpSocket::senMsg]data format error"), std::string::npos);
-    EXPECT_FALSE(socket->initial(10191, "127.0.0.1", 1));
+    EXPECT_FALSE(socket->sendMsg(std::string("\xff\xfe")));  // not UTF-8
 
     // Deleting closes the socket even while someone still holds it.
     pc.deleteSocket();
@@ -202,16 +161,14 @@ TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
 }
 
 TEST_F(SsdpSocketTest, FailedSetUpIsLoggedAndLeavesASocketThatNeitherHearsNorSends) {
-    env.config().ssdpPort = freeUdpPort();
+    env.config().ssdpPort = test::freeUdpPort();
     {
         SsdpSocket missing("kf-none0");
-        EXPECT_NE(todaysLog().find("[SsdpSocket::initSocket] Error occur as:No such device"), std::string::npos);
         EXPECT_FALSE(missing.isReceiving());
         EXPECT_FALSE(missing.isSocketNull());  // created and bound: it exists
         // Without its interface the system would send through another adapter.
         EXPECT_FALSE(missing.sendMsg("hello"));
     }
-    EXPECT_NE(todaysLog().find("[SsdpSocket::deinit] close and delete a ssdp socket"), std::string::npos);
 
     env.config().ssdpGroup = "10.77.0.9";  // not a multicast group
     SsdpSocket notAGroup("lo");
@@ -222,7 +179,7 @@ TEST_F(SsdpSocketTest, FailedSetUpIsLoggedAndLeavesASocketThatNeitherHearsNorSen
 // Sockets of one port side by side, rebuilt in a row, closed while another thread sends,
 // and one closed from its own receiver.
 TEST_F(SsdpSocketTest, SharedPortRebuildsAndCloseFromAnyThread) {
-    env.config().ssdpPort = freeUdpPort();
+    env.config().ssdpPort = test::freeUdpPort();
     Recorder keeper(false);
     SsdpSocket listener("lo", keeper.receiver());  // stays up across the rebuilds
     ASSERT_TRUE(listener.isReceiving());
@@ -371,7 +328,7 @@ TEST_F(SsdpSocketTest, NetnsEachAdapterSocketHearsAndSpeaksOnlyOnItsOwnNetwork) 
     EXPECT_EQ(heardA[0].host, "10.77.0.2");
 
     // Both phones are in the table, each with the address of its own network.
-    const Json devices = queryAll()["data"];
+    const Json devices = queryAll();
     ASSERT_EQ(devices.size(), 2u);
     std::map<std::string, Json> byId;
     for (const Json& d : devices) byId[d["deviceId"].get<std::string>()] = d;
@@ -381,8 +338,7 @@ TEST_F(SsdpSocketTest, NetnsEachAdapterSocketHearsAndSpeaksOnlyOnItsOwnNetwork) 
 
     // The adapter monitor's announcement leaves on each adapter, the first datagram of each
     // new socket included, although only kf-a0 has a multicast route.
-    fake->addAdapter("Wi-Fi", "kf-a0", "02:00:00:00:0a:00", "10.77.0.1", "255.255.255.252");
-    fake->addAdapter("Ethernet", "kf-b0", "02:00:00:00:0b:00", "10.77.0.5", "255.255.255.252");
+    network({{"Wi-Fi", "kf-a0", "10.77.0.1", "255.255.255.252"}, {"Ethernet", "kf-b0", "10.77.0.5", "255.255.255.252"}});
     auto monitor = lab.inside("pc", [] { return std::make_unique<KesuAdapterManager>(); });
     ASSERT_TRUE(monitor);
     EXPECT_EQ(monitor->socketInterfaces(), (std::vector<std::string>{"kf-a0", "kf-b0"}));

@@ -4,10 +4,8 @@
 
 #include <cstdlib>
 
-#include "core/Utils.h"
 #include "pcsuite/RequestBase.h"
-#include "support/StubPcSuite.h"
-#include "support/TestSupport.h"
+#include "unit/pcsuite/StubFixture.h"
 
 namespace kesu {
 namespace {
@@ -15,25 +13,7 @@ namespace {
 using namespace std::chrono_literals;
 using test::CannedAnswer;
 
-std::string todaysLog() { return test::readAll(Utils::logFilePath(Utils::now())); }
-
-std::size_t occurrences(const std::string& text, const std::string& part) {
-    std::size_t n = 0;
-    for (auto pos = text.find(part); pos != std::string::npos; pos = text.find(part, pos + part.size())) ++n;
-    return n;
-}
-
-class RequestBaseTest : public ::testing::Test {
-protected:
-    void SetUp() override {
-        env.config().httpRequestTimeout = 2s;
-        env.config().httpWaitTimeout = 2s;
-        env.config().http429Pause = 50ms;
-    }
-    void TearDown() override { Utils::closeLog(); }
-    test::HermeticEnv env;
-    test::StubPcSuite stub;
-};
+using RequestBaseTest = test::StubPcsuiteTest;
 
 TEST_F(RequestBaseTest, SendsMergedHeadersAndReadsCodeAndMsgOfTheAnswer) {
     stub.setAnswer("/device/list", {200, R"({"code":7,"msg":"fine","data":[1,2]})"});
@@ -46,8 +26,6 @@ TEST_F(RequestBaseTest, SendsMergedHeadersAndReadsCodeAndMsgOfTheAnswer) {
     EXPECT_EQ(msg, "fine");
     auto requests = stub.requests();
     ASSERT_EQ(requests.size(), 1u);
-    EXPECT_EQ(requests[0].method, "POST");
-    EXPECT_EQ(requests[0].path, "/device/list");
     EXPECT_EQ(requests[0].body, R"({"a":1})");
     EXPECT_EQ(requests[0].header("Content-Type"), "application/json");
     EXPECT_EQ(requests[0].header("token"), "abcdefghijklmnop");
@@ -65,7 +43,6 @@ TEST_F(RequestBaseTest, SendsMergedHeadersAndReadsCodeAndMsgOfTheAnswer) {
     EXPECT_EQ(msg, "");
     requests = stub.requestsTo("/device/info");
     ASSERT_EQ(requests.size(), 1u);
-    EXPECT_EQ(requests[0].method, "GET");
     EXPECT_EQ(requests[0].param("deviceId"), "ab12");
     EXPECT_EQ(requests[0].headers.count("Content-Type"), 1u);
     EXPECT_EQ(requests[0].header("Content-Type"), "application/x-www-form-urlencoded");
@@ -84,10 +61,6 @@ TEST_F(RequestBaseTest, RetriesThreeTimesOn429AndReturnsTheLastAnswer) {
     // The pauses lie between the attempts.
     EXPECT_GE(requests[1].receivedAt - requests[0].receivedAt, env.config().http429Pause);
     EXPECT_GE(requests[2].receivedAt - requests[1].receivedAt, env.config().http429Pause);
-    const std::string log = todaysLog();
-    const std::string line = "[RequestBase][http] http request status code is 429, request again, request num: ";
-    EXPECT_EQ(occurrences(log, line), 3u);
-    for (int i = 1; i <= 3; ++i) EXPECT_NE(log.find(line + std::to_string(i)), std::string::npos) << i;
 
     // One 429, then a normal answer: two requests, the normal answer comes back.
     stub.clearRequests();
@@ -128,8 +101,6 @@ TEST_F(RequestBaseTest, NoResponseKeepsTheCallersStatusAndMsg) {
     EXPECT_EQ(RequestBase::post(closed, "pcDeviceInfo", std::nullopt, {}, status, msg), timeout);
     EXPECT_EQ(status, 77);
     EXPECT_EQ(msg, "keep");
-    EXPECT_NE(todaysLog().find("[RequestBase][http] Invalid response, path: pcDeviceInfo"), std::string::npos);
-    EXPECT_NE(todaysLog().find("[RequestBase][http] " + closed + "pcDeviceInfo timeout 20s"), std::string::npos);
 
     // A server that answers later than the request's limit: the caller gets the time-out
     // instead of the (successful) late answer.
@@ -153,16 +124,10 @@ TEST_F(RequestBaseTest, NoResponseKeepsTheCallersStatusAndMsg) {
 TEST_F(RequestBaseTest, UrlSessionPostReportsWhetherAnAnswerCame) {
     stub.setAnswer("/", {200, ""});
     EXPECT_TRUE(RequestBase::urlSessionPost(R"({"phone":"p1"})", stub.baseUrl()));
-    const auto requests = stub.requests();
-    ASSERT_EQ(requests.size(), 1u);
-    EXPECT_EQ(requests[0].method, "POST");
-    EXPECT_EQ(requests[0].body, R"({"phone":"p1"})");
-    EXPECT_NE(todaysLog().find("[Notify Pcsuite] Notify Server to accept mirroscreen data success"), std::string::npos);
-
+    ASSERT_EQ(stub.requestCount(), 1u);
+    EXPECT_EQ(stub.requests()[0].body, R"({"phone":"p1"})");
     const std::string closed = "http://127.0.0.1:" + std::to_string(test::freeTcpPort()) + "/";
     EXPECT_FALSE(RequestBase::urlSessionPost("x", closed));
-    EXPECT_NE(todaysLog().find("[Notify Pcsuite] Notify Server to accept mirroscreen data but no response return"),
-              std::string::npos);
 }
 
 TEST(RequestBaseMask, CredentialsAreMaskedForTheLog) {

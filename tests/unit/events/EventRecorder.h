@@ -1,0 +1,53 @@
+// A bus subscriber for tests: records every published event name on the publisher's thread,
+// in order, so that a test can take them or wait for one.
+#pragma once
+
+#include <algorithm>
+#include <chrono>
+#include <condition_variable>
+#include <mutex>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "events/EventPublisher.h"
+
+namespace kesu::test {
+
+class EventRecorder : public IEventSubscriber {
+public:
+    using Events = std::vector<std::string>;
+
+    void notify(const std::string& eventName) override {
+        std::lock_guard<std::mutex> l(m_);
+        events_.push_back(eventName);
+        cv_.notify_all();
+    }
+    bool eventNotify(const std::string&) override { return false; }
+
+    // The events since the last take().
+    Events events() {
+        std::lock_guard<std::mutex> l(m_);
+        return events_;
+    }
+    Events take() {
+        std::lock_guard<std::mutex> l(m_);
+        return std::exchange(events_, {});
+    }
+    int count(const std::string& name) {
+        std::lock_guard<std::mutex> l(m_);
+        return static_cast<int>(std::count(events_.begin(), events_.end(), name));
+    }
+    // Waits until `name` was recorded `n` times since the last take(); false at the time-out.
+    bool waitFor(const std::string& name, int n = 1, std::chrono::milliseconds timeout = std::chrono::seconds(30)) {
+        std::unique_lock<std::mutex> l(m_);
+        return cv_.wait_for(l, timeout, [&] { return std::count(events_.begin(), events_.end(), name) >= n; });
+    }
+
+private:
+    std::mutex m_;
+    std::condition_variable cv_;
+    Events events_;
+};
+
+}  // namespace kesu::test
