@@ -26,6 +26,7 @@
 
 #include "BenchSupport.h"
 #include "connect/PhoneFrame.h"
+#include "discovery/SsdpMessage.h"
 
 namespace {
 
@@ -133,14 +134,6 @@ void ratio(const char* what, const std::vector<double>& a, const std::vector<dou
                 percentile(a, 0.99) / percentile(b, 0.99));
 }
 
-// The table id the service gives an announced id: the hex of its first four characters.
-std::string tableId(const std::string& id) {
-    static const char* digits = "0123456789abcdef";
-    std::string out;
-    for (unsigned char c : id.substr(0, 4)) out += {digits[c >> 4], digits[c & 15]};
-    return out;
-}
-
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -181,32 +174,35 @@ int main(int argc, char** argv) {
                 ::sendto(udp, datagram.data(), datagram.size(), 0, reinterpret_cast<sockaddr*>(&group), sizeof group);
             };
             const std::string queryAll = controlBody("SSDPQueryAll");
-
-            // Announcement to table: a new id each round, then SSDPQueryAll back to back until
-            // it shows.
-            std::vector<double> appear, query;
-            for (int i = 0; i < announcements; ++i) {
-                char id[32];
-                std::snprintf(id, sizeof id, "Q%03d-BENCH", i);
-                const std::string wanted = "\"" + tableId(id) + "\"";
+            // Announces `id`, then asks SSDPQueryAll back to back until it shows (at most 5 s);
+            // each query's round trip goes to `query`.
+            std::vector<double> query;
+            const auto announceAndAwait = [&](const std::string& id) {
+                const std::string wanted = "\"" + kesu::SsdpMessage::deviceIdentifier(id) + "\"";
                 const auto t0 = Clock::now();
                 announce(id);
-                for (;;) {
+                while (Clock::now() - t0 < std::chrono::seconds(5)) {
                     const auto q0 = Clock::now();
                     const auto answer = service.control(queryAll);
                     query.push_back(micros(Clock::now() - q0));
-                    if (answer && answer->find(wanted) != std::string::npos) break;
-                    if (Clock::now() - t0 > std::chrono::seconds(5)) {
-                        std::fprintf(stderr, "announcement %s never appeared\n", id);
-                        break;
-                    }
+                    if (answer && answer->find(wanted) != std::string::npos) return micros(Clock::now() - t0);
                 }
-                appear.push_back(micros(Clock::now() - t0));
+                std::fprintf(stderr, "announcement %s never appeared\n", id.c_str());
+                return micros(Clock::now() - t0);
+            };
+
+            // Announcement to table: a new id each round.
+            std::vector<double> appear;
+            for (int i = 0; i < announcements; ++i) {
+                char id[32];
+                std::snprintf(id, sizeof id, "Q%03d-BENCH", i);
+                appear.push_back(announceAndAwait(id));
             }
 
             // connectSSDP to a phone that accepts at once.
             const std::string phoneId = "CONNECT-BENCH";
-            const std::string connectBody = controlBody("connectSSDP", Json::array({tableId(phoneId)}));
+            const std::string connectBody =
+                controlBody("connectSSDP", Json::array({kesu::SsdpMessage::deviceIdentifier(phoneId)}));
             const kesu::Bytes requestSized = kesu::buildPhoneFrameFromJson(
                 Json{{"bytes", {0}}, {"deviceName", "bench-pc"}, {"channel", 0}, {"id", 87654321},
                      {"open_Id", "5f2c9e7a1d3b4c6e8f0a2b4c6d8e0f12"}, {"service_id", "com.kesu.pcsuite.SERVICE"},
@@ -215,12 +211,9 @@ int main(int argc, char** argv) {
             int failures = 0;
             for (int i = 0; i < connects; ++i) {
                 if (i % 50 == 0) {  // keep the phone well inside the 30 s expiry
-                    announce(phoneId);
-                    const auto t0 = Clock::now();
-                    while (Clock::now() - t0 < std::chrono::seconds(5)) {
-                        const auto answer = service.control(queryAll);
-                        if (answer && answer->find("\"" + tableId(phoneId) + "\"") != std::string::npos) break;
-                    }
+                    const std::size_t queries = query.size();
+                    announceAndAwait(phoneId);
+                    query.resize(queries);  // those queries are not part of the appearance figure
                 }
                 const auto t0 = Clock::now();
                 const auto answer = service.control(connectBody);
