@@ -82,7 +82,8 @@ void LaunchService::launchService(const std::string& ip, const std::string& loca
     Utils::mPrintlog("[launchService] startAllowedWindow exitCode is " + std::to_string(exitCode));
     if (exitCode != 0) Utils::mPrintlog("[launchService] reject for exitCode " + std::to_string(exitCode));
 
-    const long long seqNo = Utils::getNfcLanConnectSeqNo();
+    // A sequence number is used up only by a hand-over that happens, so the receiver sees
+    // 0, 1, 2, ... with no gap for a refused request.
     if (forPcsuite) {
         Utils::mPrintlog("[launchService] launch service is pcsuite \n");
         if (exitCode != 0 || !Utils::getIsAllowWindow()) {
@@ -93,6 +94,7 @@ void LaunchService::launchService(const std::string& ip, const std::string& loca
         Utils::mPrintlog("[launchService] send tcp agree data to phone \n");
         sendTcp(ConnectTag::AGREE, serviceId::pcsuiteId);
 
+        const long long seqNo = Utils::getNfcLanConnectSeqNo();
         const bool autoConnect = Utils::getThisPhoneAutoConnect();
         if (sendPhoneInfoToPcsuite(localIp, ip, request.deviceName, kConnectionMode, request.deviceId, seqNo,
                                    autoConnect, request.account, request.deviceType, request.openId)) {
@@ -109,7 +111,8 @@ void LaunchService::launchService(const std::string& ip, const std::string& loca
         Utils::mPrintlog("[launchService] send tcp agree data to phone \n");
         sendTcp(ConnectTag::AGREE, serviceId::shareId);
         Utils::mPrintlog("[launchService] start to launch kesu share allowed window \n");
-        startKesuShareAllowedWindow(request.deviceName, request.deviceId, ip, request.openId, seqNo, request.port);
+        startKesuShareAllowedWindow(request.deviceName, request.deviceId, ip, request.openId,
+                                    Utils::getNfcLanConnectSeqNo(), request.port);
     }
     Utils::mPrintlog(
         "[launchService] waiting for pcsuite/kesushare connecting websocket result by [reportNFCConnectResult] \n");

@@ -146,6 +146,17 @@ TEST_F(PhoneServer, OtherPhonesAreBusyWhileOneIsHandled) {
     ASSERT_TRUE(server.waitForNoLinks(kLong));
     EXPECT_TRUE(pcsuite.requestsTo("/").empty());  // a refused phone is not handed over
     EXPECT_EQ(pcsuite.requestsTo("/isConnectBusy").size(), 1u);
+
+    // Neither the refusal nor the busy answers used up a sequence number: the first
+    // hand-over is still number 0.
+    auto agreed = send(request("com.kesu.pcsuite.SERVICE", 0));
+    ASSERT_TRUE(window->next(kLong));
+    EXPECT_EQ(control("QtAgree", {"false"})["error"], 0);
+    EXPECT_EQ(answer(*agreed)["bytes"], Json::array({3}));
+    const auto handOver = pcsuite.waitForRequest([](const test::RecordedRequest& r) { return r.path == "/"; }, kLong);
+    ASSERT_TRUE(handOver);
+    const Json message = Json::parse(handOver->body.substr(handOver->body.find('#') + 1));
+    EXPECT_EQ(message["args"][4], "0");
 }
 
 TEST_F(PhoneServer, BusyPcSuiteAnswersByDeviceType) {
