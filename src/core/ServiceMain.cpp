@@ -8,6 +8,7 @@
 #include "account/DataGet.h"
 #include "account/FileMonitor.h"
 #include "control/HttpService.h"
+#include "core/EventLoop.h"
 #include "core/HttpAliveCheck.h"
 #include "core/ServiceManager.h"
 #include "core/SingleInstance.h"
@@ -39,7 +40,9 @@ int runService() {
     fileMonitorStart();
     updateHistoryDevice();
 
-    ServiceManager manager;
+    EventLoop loop;
+    loop.start();
+    ServiceManager manager(loop);
     manager.start();
     HttpAliveCheck watchdog;
 
@@ -51,6 +54,7 @@ int runService() {
     manager.stop();
     fileMonitorStop();
     HttpService::httpService().stop();
+    loop.stop();
     Utils::mPrintlog("[服务启动] stopped");
     Utils::closeLog();
     return 0;

@@ -2,6 +2,7 @@
 
 #include "connect/SocketServer.h"
 #include "core/Config.h"
+#include "core/EventLoop.h"
 #include "core/RestartServiceSubscriber.h"
 #include "events/EventDetected.h"
 #include "events/PreConnectEventSubscriber.h"
@@ -13,7 +14,7 @@
 
 namespace kesu {
 
-ServiceManager::ServiceManager() = default;
+ServiceManager::ServiceManager(EventLoop& loop) : loop_(loop) {}
 ServiceManager::~ServiceManager() { stop(); }
 
 void ServiceManager::start() {

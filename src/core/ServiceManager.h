@@ -7,6 +7,7 @@
 
 namespace kesu {
 
+class EventLoop;
 class IEventSubscriber;
 class EventDetected;
 class ServiceWorker;
@@ -15,7 +16,8 @@ class WlanDeviceDelete;
 
 class ServiceManager {
 public:
-    ServiceManager();
+    // Every worker runs its sockets and timers on `loop`, which outlives the manager.
+    explicit ServiceManager(EventLoop& loop);
     ~ServiceManager();  // defined where EventDetected is complete
     ServiceManager(const ServiceManager&) = delete;
     ServiceManager& operator=(const ServiceManager&) = delete;
@@ -25,6 +27,7 @@ public:
     void restart();
 
 private:
+    EventLoop& loop_;
     bool started_ = false;
     std::vector<std::shared_ptr<IEventSubscriber>> subscribers_;
     std::unique_ptr<EventDetected> eventDetected_;

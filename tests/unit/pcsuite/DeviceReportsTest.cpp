@@ -7,6 +7,7 @@
 #include <memory>
 #include <string>
 
+#include "core/EventLoop.h"
 #include "core/ServiceManager.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/SsdpMessage.h"
@@ -292,7 +293,9 @@ TEST_F(DeviceReportsTest, ServiceStartWiresTheLanReports) {
     SsdpDeviceManager& global = SsdpDeviceManager::instance();
     global.ssdpDeviceMap.eraseTimeOut(1e300);
 
-    ServiceManager manager;
+    EventLoop loop;
+    loop.start();
+    ServiceManager manager(loop);
     manager.start();
     ASSERT_TRUE(waitForPath(pcsuite, kLanPath, 1, 10s));
     EXPECT_EQ(pcsuite.requestsTo(kLanPath).at(0).body, "[]");
