@@ -6,7 +6,6 @@
 #include <httplib.h>
 #include <sched.h>
 #include <signal.h>
-#include <spawn.h>
 #include <stdlib.h>
 #include <sys/wait.h>
 
@@ -22,6 +21,7 @@
 
 #include "core/Json.h"
 #include "discovery/Base64.h"
+#include "support/PidNamespace.h"
 
 extern char** environ;
 
@@ -72,8 +72,9 @@ inline bool enterNewNamespace(const std::string& name) {
 }
 
 // The real service binary in the named network namespace (started through `ip netns exec`,
-// so that it sees that namespace's adapters), its output discarded (or written to
-// $KESU_BENCH_LOG), HOME and KESU_ROOT in a scratch folder.
+// so that it sees that namespace's adapters) and in a PID namespace of its own (so that a
+// copy running on the machine does not make it stand down), its output discarded (or
+// written to $KESU_BENCH_LOG), HOME and KESU_ROOT in a scratch folder.
 class BenchService {
 public:
     explicit BenchService(const std::string& netns) {
@@ -91,14 +92,12 @@ public:
         std::vector<char*> cenv;
         for (auto& e : envs) cenv.push_back(e.data());
         cenv.push_back(nullptr);
-        posix_spawn_file_actions_t actions;
-        posix_spawn_file_actions_init(&actions);
         const char* log = std::getenv("KESU_BENCH_LOG");
-        posix_spawn_file_actions_addopen(&actions, 1, log ? log : "/dev/null", O_WRONLY | O_CREAT | O_TRUNC, 0644);
+        const int out = ::open(log ? log : "/dev/null", O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
         std::string ip = "/usr/sbin/ip", netnsWord = "netns", exec = "exec", ns = netns, binary = KESU_BINARY;
         char* args[] = {ip.data(), netnsWord.data(), exec.data(), ns.data(), binary.data(), nullptr};
-        if (posix_spawn(&pid_, args[0], &actions, nullptr, args, cenv.data()) != 0) pid_ = -1;
-        posix_spawn_file_actions_destroy(&actions);
+        if (out >= 0) pid_ = test::spawnInPidNamespace(args, cenv.data(), out, -1);
+        if (out >= 0) ::close(out);
         client_.set_keep_alive(true);
         client_.set_tcp_nodelay(true);
         client_.set_read_timeout(std::chrono::seconds(60));

@@ -3,5 +3,5 @@
 set -euo pipefail
 cd "$(dirname "$0")/.."
 ./scripts/setup.sh
-KESU_BUILD_DIR="${KESU_BUILD_DIR:-build}" ./scripts/build.sh --target KesuConnService
+KESU_BUILD_DIR="${KESU_BUILD_DIR:-build}" ./scripts/build.sh KesuConnService
 exec "${KESU_BUILD_DIR:-build}/KesuConnService"

@@ -8,7 +8,7 @@ packages=(
   libasio-dev libcpp-httplib-dev libssl-dev zlib1g-dev libbrotli-dev
   nlohmann-json3-dev libspdlog-dev libfmt-dev libsqlite3-dev sqlite3 libutf8proc-dev
   googletest libgtest-dev libgmock-dev libbenchmark-dev
-  iproute2 procps iputils-ping curl python3
+  iproute2 procps iputils-ping curl python3 util-linux systemd
 )
 
 missing=()

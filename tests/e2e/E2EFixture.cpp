@@ -57,7 +57,7 @@ NetNsLab::Node LabTest::addPhone(const std::string& name, int host) {
 std::unique_ptr<ServiceProcess> LabTest::startService() {
     auto p = std::make_unique<ServiceProcess>(KESU_BINARY, std::vector<std::string>{},
                                               std::map<std::string, std::string>{{"HOME", home}, {"KESU_ROOT", root}},
-                                              pc.ns);
+                                              pc.ns, ServiceProcess::Pids::own);
     EXPECT_TRUE(p->waitForOutput("[httpService]Run succ", 20s)) << p->output();
     return p;
 }

@@ -1,4 +1,5 @@
-// The real service binary, started with HOME and KESU_ROOT in a temporary folder.
+// The real service binary, started with HOME and KESU_ROOT in a temporary folder, in a PID
+// namespace of its own.
 #include <arpa/inet.h>
 #include <gtest/gtest.h>
 #include <httplib.h>
@@ -15,6 +16,7 @@
 
 #include "core/TimeUtil.h"
 #include "e2e/PrivateNetwork.h"
+#include "support/NetNs.h"
 #include "support/ServiceProcess.h"
 #include "support/TestSupport.h"
 
@@ -46,7 +48,8 @@ struct Daemon {
     std::map<std::string, std::string> env() const { return {{"HOME", home}, {"KESU_ROOT", root}}; }
     std::unique_ptr<ServiceProcess> start() const {
         if (skip) return nullptr;
-        auto p = std::make_unique<ServiceProcess>(KESU_BINARY, std::vector<std::string>{}, env());
+        auto p = std::make_unique<ServiceProcess>(KESU_BINARY, std::vector<std::string>{}, env(), "",
+                                                  ServiceProcess::Pids::own);
         EXPECT_TRUE(p->waitForOutput("[httpService]Run succ", 20s)) << p->output();
         return p;
     }
@@ -134,12 +137,37 @@ TEST(ServiceE2E, SecondInstanceLeavesTheFirstRunning) {
     if (daemon.skip) GTEST_SKIP() << "*** no private network namespace (needs root): not starting the service ***";
     auto first = daemon.start();
 
-    ServiceProcess second(KESU_BINARY, {}, daemon.env());
+    // The second copy joins the first one's PID namespace and /proc, so each sees the other.
+    ServiceProcess second("/usr/bin/nsenter",
+                          {"--target", std::to_string(first->pid()), "--pid", "--mount", "--", KESU_BINARY},
+                          daemon.env());
     EXPECT_EQ(second.waitExit(20s), 0);
     EXPECT_NE(second.output().find("[服务启动] 服务已存在，终止操作"), std::string::npos) << second.output();
     EXPECT_TRUE(first->running());
     EXPECT_TRUE(isAlive(heartbeat()));
     EXPECT_EQ(first->stop(SIGINT, 10s), 0);
+}
+
+// A copy already running on the machine (here in a network namespace of its own, among the
+// machine's processes) does not stop the one under test, which sees only its own namespace.
+TEST(ServiceE2E, StartsBesideACopyRunningOnTheMachine) {
+    Daemon daemon;
+    if (daemon.skip) GTEST_SKIP() << "*** no private network namespace (needs root): not starting the service ***";
+    kesu::test::NetNsLab lab("own", false);
+    const auto node = lab.addNode("pc", 1);
+    ASSERT_TRUE(lab.ok()) << lab.error();
+    Daemon machineWide;
+    ServiceProcess other(KESU_BINARY, {}, machineWide.env(), node.ns);
+    // Where the machine runs a copy already, this one stands down, which serves as well.
+    const bool otherUp = other.waitForOutput("[httpService]Run succ", 20s);
+    ASSERT_TRUE(otherUp || other.output().find("服务已存在") != std::string::npos) << other.output();
+
+    auto service = daemon.start();
+    EXPECT_TRUE(isAlive(heartbeat()));
+    EXPECT_EQ(service->stop(SIGTERM, 10s), 0);
+    if (otherUp) {
+        EXPECT_EQ(other.stop(SIGTERM, 10s), 0);
+    }
 }
 
 TEST(ServiceE2E, ControlPortIsLoopbackOnly) {

@@ -1,5 +1,6 @@
 #include "support/ServiceProcess.h"
 
+#include <errno.h>
 #include <fcntl.h>
 #include <signal.h>
 #include <spawn.h>
@@ -9,12 +10,14 @@
 #include <cstring>
 #include <stdexcept>
 
+#include "support/PidNamespace.h"
+
 extern char** environ;
 
 namespace kesu::test {
 
 ServiceProcess::ServiceProcess(const std::string& path, const std::vector<std::string>& args,
-                               const std::map<std::string, std::string>& env, const std::string& netns) {
+                               const std::map<std::string, std::string>& env, const std::string& netns, Pids pids) {
     std::vector<std::string> argv;
     if (!netns.empty()) argv = {"/usr/sbin/ip", "netns", "exec", netns};
     argv.push_back(path);
@@ -39,19 +42,25 @@ ServiceProcess::ServiceProcess(const std::string& path, const std::vector<std::s
 
     int pipeFds[2];
     if (pipe2(pipeFds, O_CLOEXEC) != 0) throw std::runtime_error("pipe failed");
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_adddup2(&actions, pipeFds[1], 1);
-    posix_spawn_file_actions_adddup2(&actions, pipeFds[1], 2);
-    posix_spawnattr_t attr;
-    posix_spawnattr_init(&attr);
-    sigset_t none;
-    sigemptyset(&none);
-    posix_spawnattr_setsigmask(&attr, &none);
-    posix_spawnattr_setflags(&attr, POSIX_SPAWN_SETSIGMASK);
-    int rc = posix_spawn(&pid_, cargv[0], &actions, &attr, cargv.data(), cenv.data());
-    posix_spawn_file_actions_destroy(&actions);
-    posix_spawnattr_destroy(&attr);
+    int rc = 0;
+    if (pids == Pids::own) {
+        pid_ = spawnInPidNamespace(cargv.data(), cenv.data(), pipeFds[1], pipeFds[1]);
+        if (pid_ < 0) rc = errno;
+    } else {
+        posix_spawn_file_actions_t actions;
+        posix_spawn_file_actions_init(&actions);
+        posix_spawn_file_actions_adddup2(&actions, pipeFds[1], 1);
+        posix_spawn_file_actions_adddup2(&actions, pipeFds[1], 2);
+        posix_spawnattr_t attr;
+        posix_spawnattr_init(&attr);
+        sigset_t none;
+        sigemptyset(&none);
+        posix_spawnattr_setsigmask(&attr, &none);
+        posix_spawnattr_setflags(&attr, POSIX_SPAWN_SETSIGMASK);
+        rc = posix_spawn(&pid_, cargv[0], &actions, &attr, cargv.data(), cenv.data());
+        posix_spawn_file_actions_destroy(&actions);
+        posix_spawnattr_destroy(&attr);
+    }
     ::close(pipeFds[1]);
     if (rc != 0) {
         ::close(pipeFds[0]);

@@ -17,10 +17,18 @@ namespace kesu::test {
 
 class ServiceProcess {
 public:
+    // Where the child sits among the machine's processes: beside them (`shared`), or as the
+    // first process of a PID namespace of its own with its own /proc (`own`, root only; see
+    // PidNamespace.h), where the service's single-instance check sees none but itself.
+    enum class Pids { shared, own };
+
     // Starts `path` with `args`; `env` entries are added to (or replace) this process's
-    // environment. Optionally runs it inside a network namespace (`ip netns exec NS`).
+    // environment. Optionally runs it inside a network namespace (`ip netns exec NS`). With
+    // Pids::own, pid() is the child itself (not a launcher), so stop() signals it directly
+    // and its exit code comes back; it is killed when the thread that started it ends.
     ServiceProcess(const std::string& path, const std::vector<std::string>& args,
-                   const std::map<std::string, std::string>& env, const std::string& netns = "");
+                   const std::map<std::string, std::string>& env, const std::string& netns = "",
+                   Pids pids = Pids::shared);
     ~ServiceProcess();
     ServiceProcess(const ServiceProcess&) = delete;
     ServiceProcess& operator=(const ServiceProcess&) = delete;
