@@ -115,7 +115,10 @@ std::string ServiceProcess::output() const {
 
 std::optional<int> ServiceProcess::waitExit(std::chrono::milliseconds timeout) {
     std::unique_lock<std::mutex> lock(mutex_);
-    cv_.wait_for(lock, timeout, [&] { return exitCode_.has_value(); });
+    if (!cv_.wait_for(lock, timeout, [&] { return exitCode_.has_value(); })) return std::nullopt;
+    // The exit can be seen before the reader has taken the last output: give it a moment to
+    // reach the end of the pipe (a grandchild that keeps the pipe open only delays this).
+    cv_.wait_for(lock, std::chrono::seconds(5), [&] { return outputClosed_; });
     return exitCode_;
 }
 
