@@ -1,6 +1,8 @@
 // Control API benchmark against the real binary: HeartBeat round trips over HTTP next to a
-// raw TCP echo round trip on loopback measured in the same run, then the idle CPU and RSS
-// of the service over a quiet period.
+// raw TCP echo round trip on loopback measured in the same run, on one kept-alive connection
+// and on a new connection per request (where the service checks who is at the other end);
+// the cost of that check itself (socket-table look-ups against getpeername calls); then the
+// idle CPU and RSS of the service over a quiet period.
 //
 //   build/bench/control_bench [requests=2000] [idle_seconds=30]
 #include <arpa/inet.h>
@@ -27,6 +29,7 @@
 #include <vector>
 
 #include "BenchSupport.h"
+#include "platform/PeerOwner.h"
 
 
 namespace {
@@ -74,6 +77,86 @@ std::vector<double> echoRoundTrips(int count, size_t payload) {
     server.join();
     ::close(listener);
     return out;
+}
+
+// A raw TCP echo on loopback with a new connection per round trip: connect, send, read the
+// echo, close. The floor for a request on a fresh connection.
+std::vector<double> connectEchoRoundTrips(int count, size_t payload) {
+    int listener = ::socket(AF_INET, SOCK_STREAM, 0);
+    sockaddr_in addr{};
+    addr.sin_family = AF_INET;
+    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    ::bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+    socklen_t len = sizeof addr;
+    ::getsockname(listener, reinterpret_cast<sockaddr*>(&addr), &len);
+    ::listen(listener, 64);
+    std::thread server([listener, count] {
+        char buf[4096];
+        for (int i = 0; i < count; ++i) {
+            int c = ::accept(listener, nullptr, nullptr);
+            if (c < 0) break;
+            int one = 1;
+            setsockopt(c, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
+            ssize_t n;
+            while ((n = ::read(c, buf, sizeof buf)) > 0) ::write(c, buf, static_cast<size_t>(n));
+            ::close(c);
+        }
+    });
+    std::string msg(payload, 'x');
+    std::vector<char> buf(payload);
+    std::vector<double> out;
+    for (int i = 0; i < count; ++i) {
+        auto t0 = Clock::now();
+        int s = ::socket(AF_INET, SOCK_STREAM, 0);
+        int one = 1;
+        setsockopt(s, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
+        ::connect(s, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+        ::write(s, msg.data(), msg.size());
+        size_t got = 0;
+        while (got < payload) {
+            ssize_t n = ::read(s, buf.data() + got, payload - got);
+            if (n <= 0) break;
+            got += static_cast<size_t>(n);
+        }
+        ::close(s);
+        out.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+    }
+    server.join();
+    ::close(listener);
+    return out;
+}
+
+// The connection check's own cost: `count` owner look-ups of a loopback connection's far end
+// against `count` getpeername calls on the same socket (the floor of any per-connection
+// work); both totals in microseconds.
+std::pair<double, double> lookupCost(int count) {
+    int listener = ::socket(AF_INET, SOCK_STREAM, 0);
+    sockaddr_in addr{};
+    addr.sin_family = AF_INET;
+    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    ::bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+    socklen_t len = sizeof addr;
+    ::getsockname(listener, reinterpret_cast<sockaddr*>(&addr), &len);
+    ::listen(listener, 1);
+    int client = ::socket(AF_INET, SOCK_STREAM, 0);
+    ::connect(client, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+    int served = ::accept(listener, nullptr, nullptr);
+    int found = 0;
+    auto t0 = Clock::now();
+    for (int i = 0; i < count; ++i) found += kesu::peer::connectedPeerOwner(served).has_value();
+    const double lookups = micros(Clock::now() - t0);
+    sockaddr_storage peer{};
+    t0 = Clock::now();
+    for (int i = 0; i < count; ++i) {
+        socklen_t peerLen = sizeof peer;
+        found += ::getpeername(served, reinterpret_cast<sockaddr*>(&peer), &peerLen) == 0;
+    }
+    const double peernames = micros(Clock::now() - t0);
+    if (found != 2 * count) std::fprintf(stderr, "look-ups failed: %d of %d\n", 2 * count - found, 2 * count);
+    ::close(served);
+    ::close(client);
+    ::close(listener);
+    return {lookups, peernames};
 }
 
 long ticksOf(pid_t pid) {
@@ -134,11 +217,36 @@ int main(int argc, char** argv) {
     }
     const auto echo = echoRoundTrips(requests, body.size() + 120);
 
+    // A new connection per request: the service checks each connection's owner once.
+    httplib::Client fresh("127.0.0.1", 9197);
+    fresh.set_keep_alive(false);
+    fresh.set_tcp_nodelay(true);
+    std::vector<double> httpFresh;
+    for (int i = 0; i < requests; ++i) {
+        auto t0 = Clock::now();
+        auto res = fresh.Post("/", body, "text/plain");
+        httpFresh.push_back(micros(Clock::now() - t0));
+        if (!res || res->status != 200) {
+            std::fprintf(stderr, "request %d on a new connection failed\n", i);
+            break;
+        }
+    }
+    const auto connectEcho = connectEchoRoundTrips(requests, body.size() + 120);
+    const auto [lookupMicros, peernameMicros] = lookupCost(requests * 5);
+
     const double hp50 = percentile(http, 0.5), hp99 = percentile(http, 0.99);
     const double ep50 = percentile(echo, 0.5), ep99 = percentile(echo, 0.99);
     std::printf("HeartBeat round trip (keep-alive, %d requests): p50 %.1f us  p99 %.1f us\n", requests, hp50, hp99);
     std::printf("raw TCP echo round trip (same run):          p50 %.1f us  p99 %.1f us\n", ep50, ep99);
     std::printf("ratio HeartBeat / echo:                       p50 %.2fx  p99 %.2fx\n", hp50 / ep50, hp99 / ep99);
+    const double fp50 = percentile(httpFresh, 0.5), fp99 = percentile(httpFresh, 0.99);
+    const double cp50 = percentile(connectEcho, 0.5), cp99 = percentile(connectEcho, 0.99);
+    std::printf("HeartBeat, new connection each (checked):    p50 %.1f us  p99 %.1f us\n", fp50, fp99);
+    std::printf("raw TCP connect+echo+close (same run):       p50 %.1f us  p99 %.1f us\n", cp50, cp99);
+    std::printf("ratio HeartBeat new conn / connect+echo:     p50 %.2fx  p99 %.2fx\n", fp50 / cp50, fp99 / cp99);
+    std::printf("owner look-up vs getpeername (%d each):   %.2f us vs %.2f us per call, ratio %.1fx\n",
+                requests * 5, lookupMicros / (requests * 5), peernameMicros / (requests * 5),
+                lookupMicros / peernameMicros);
 
     const long hz = sysconf(_SC_CLK_TCK);
     const long t0 = ticksOf(pid);

@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstring>
 
+#include "control/PeerCheckedServer.h"
 #include "control/RequestHandle.h"
 #include "control/ResponseHandler.h"
 #include "core/Config.h"
@@ -39,7 +40,10 @@ bool HttpService::startHttpServic() {
     if (serve_) return true;
     const Config& config = Config::current();
 
-    auto server = std::make_unique<httplib::Server>();
+    // Only processes of this service's own user (or root) are answered: the API carries
+    // access tokens and switches the signed-in account.
+    PeerGate* gate = &gate_;
+    auto server = std::make_unique<PeerCheckedServer>([gate](socket_t sock) { return gate->admit(sock); });
     const int threads = config.controlThreads;
     server->new_task_queue = [threads] { return new httplib::ThreadPool(static_cast<size_t>(threads)); };
     server->set_payload_max_length(config.controlMaxBody);

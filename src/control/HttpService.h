@@ -8,6 +8,8 @@
 #include <string>
 #include <thread>
 
+#include "control/PeerGate.h"
+
 namespace httplib {
 class Server;
 }
@@ -36,6 +38,7 @@ public:
     static std::string handleBody(const std::string& body);
 
 private:
+    PeerGate gate_;  // outlives every server this object starts
     mutable std::mutex mutex_;
     std::unique_ptr<httplib::Server> serve_;
     std::thread listener_;
