@@ -173,16 +173,6 @@ std::optional<std::pair<std::string, std::string>> historyIdsFromText(std::strin
                           json::str(json::object(*parsed, "last_time_pad"), "bleId"));
 }
 
-const char* databaseStateName(DatabaseState state) {
-    switch (state) {
-        case DatabaseState::Missing: return "missing";
-        case DatabaseState::Unreadable: return "unreadable";
-        case DatabaseState::Busy: return "busy";
-        case DatabaseState::Good: return "good";
-    }
-    return "unknown";
-}
-
 DatabaseReadResult readAccountDatabase(const std::string& filePath) {
     const std::string path = filePath + "/Config.db";
     DatabaseReadResult result;
@@ -313,7 +303,8 @@ void updateHistoryDevice() {
         Utils::mPrintlog("[updateHistoryDevice] history file is not valid JSON, ids kept");
         return;
     }
-    const auto& [phoneId, padId] = *ids;
+    const std::string& phoneId = ids->first;
+    const std::string& padId = ids->second;
     dataInstance().update([&](databaseParam& p) {
         p.historyPhoneId = phoneId;
         p.historyPadId = padId;

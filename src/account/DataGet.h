@@ -61,7 +61,6 @@ enum class DatabaseState {
     Busy,        // another writer held its lock longer than Config::databaseBusyTimeout
     Good,        // the account was read
 };
-const char* databaseStateName(DatabaseState state);
 
 struct DatabaseReadResult {
     DatabaseState state = DatabaseState::Unreadable;
