@@ -5,11 +5,13 @@
 
 #include <atomic>
 #include <chrono>
+#include <filesystem>
 #include <vector>
 
 #include "account/DataInstance.h"
 #include "core/Config.h"
 #include "core/Json.h"
+#include "core/Text.h"
 #include "core/Utils.h"
 #include "pcsuite/PcsuiteRequest.h"
 
@@ -26,6 +28,11 @@ const std::string kUserStatement = "SELECT openid, phone, token FROM User;";
 const std::string kSoftwareSetStatement =
     "SELECT openid,configDir,storageDir FROM SoftwareSet WHERE openid = ?;";
 
+// A read of a damaged file is cut off after this long beyond the busy wait.
+constexpr std::chrono::seconds kMaxReadWork{5};
+// No single value SQLite hands us may be larger (a bigger one fails the read).
+constexpr int kMaxSqliteValueBytes = 1 << 20;
+
 std::atomic<bool> databaseUpdate{false};
 
 std::string pcsuiteSupportDir() {
@@ -34,11 +41,20 @@ std::string pcsuiteSupportDir() {
     return base + "Application Support/pcsuite/";
 }
 
-// A text column; NULL reads as "".
-std::string columnText(sqlite3_stmt* stmt, int column) {
-    const auto* text = sqlite3_column_text(stmt, column);
-    if (text == nullptr) return {};
-    return std::string(reinterpret_cast<const char*>(text), static_cast<std::size_t>(sqlite3_column_bytes(stmt, column)));
+ColumnValue columnValue(sqlite3_stmt* stmt, int column) {
+    ColumnValue value;
+    switch (sqlite3_column_type(stmt, column)) {
+        case SQLITE_NULL: return value;
+        case SQLITE_INTEGER: value.type = ColumnValue::Type::Integer; break;
+        case SQLITE_FLOAT: value.type = ColumnValue::Type::Float; break;
+        case SQLITE_BLOB: value.type = ColumnValue::Type::Blob; break;
+        default: value.type = ColumnValue::Type::Text; break;
+    }
+    const void* data = value.type == ColumnValue::Type::Blob ? sqlite3_column_blob(stmt, column)
+                                                             : static_cast<const void*>(sqlite3_column_text(stmt, column));
+    const int size = sqlite3_column_bytes(stmt, column);
+    if (data != nullptr && size > 0) value.bytes.assign(static_cast<const char*>(data), static_cast<std::size_t>(size));
+    return value;
 }
 
 // Closes the statement and the connection whatever way a read ends.
@@ -50,6 +66,25 @@ struct ConnectionGuard {
     sqlite3* db = nullptr;
     ~ConnectionGuard() { sqlite3_close(db); }
 };
+
+// Runs one statement and folds its rows; SQLITE_OK, or the code it failed with (and `error`).
+int runStatement(sqlite3* db, const std::string& statementText, const std::string& boundValue, AccountRows& rows,
+                 std::string& error) {
+    StatementGuard statement;
+    int rc = sqlite3_prepare_v2(db, statementText.c_str(), -1, &statement.stmt, nullptr);
+    if (rc == SQLITE_OK && sqlite3_bind_parameter_count(statement.stmt) > 0)
+        rc = sqlite3_bind_text(statement.stmt, 1, boundValue.data(), static_cast<int>(boundValue.size()),
+                               SQLITE_TRANSIENT);
+    if (rc == SQLITE_OK) {
+        while ((rc = sqlite3_step(statement.stmt)) == SQLITE_ROW)
+            rows.add(columnValue(statement.stmt, 0), columnValue(statement.stmt, 1), columnValue(statement.stmt, 2));
+        if (rc == SQLITE_DONE) return SQLITE_OK;
+    }
+    error = sqlite3_errmsg(db);
+    return rc == SQLITE_OK ? SQLITE_ERROR : rc;
+}
+
+bool isLockCode(int rc) { return (rc & 0xff) == SQLITE_BUSY || (rc & 0xff) == SQLITE_LOCKED; }
 
 }  // namespace
 
@@ -89,94 +124,136 @@ std::string pcsuiteConfigFilePath() { return pcsuiteSupportDir() + "config.json"
 
 std::string historyPhoneFilePath() { return pcsuiteSupportDir() + "historyPhone.json"; }
 
-void dataBaseRead(const std::string& filePath) {
+std::optional<std::string> accountText(const ColumnValue& value) {
+    if (value.type == ColumnValue::Type::Null) return std::nullopt;
+    if (value.bytes.size() > kMaxAccountValueBytes || value.bytes.find('\0') != std::string::npos ||
+        !text::isValidUtf8(value.bytes))
+        return std::string();
+    return value.bytes;
+}
+
+void AccountRows::add(const ColumnValue& first, const ColumnValue& second, const ColumnValue& third) {
+    anyRow_ = true;
+    first_ = accountText(first).value_or("");
+    third_ = accountText(third).value_or("");
+    if (!userTable_) second_ = accountText(second).value_or("");
+    else if (auto phone = accountText(second)) phone_ = Utils::paramAddMask(*phone);
+}
+
+void AccountRows::applyTo(databaseParam& p) const {
+    if (userTable_) {
+        if (anyRow_) {
+            p.openid = first_;
+            p.token = third_;
+            if (phone_) p.Phone = *phone_;
+            p.lastOpenId = p.openid;
+            p.lastToken = p.token;
+        } else {
+            // Nobody is signed in.
+            p.openid.clear();
+            p.Phone.clear();
+            p.token.clear();
+        }
+    } else if (anyRow_) {
+        p.openid = first_;
+        p.configDir = second_;
+        p.storageDir = third_;
+    }
+}
+
+std::string deviceIdFromConfigText(std::string_view text) {
+    const auto parsed = json::parse(text);
+    return parsed ? json::str(*parsed, "newDeviceId") : std::string();
+}
+
+std::optional<std::pair<std::string, std::string>> historyIdsFromText(std::string_view text) {
+    const auto parsed = json::parse(text);
+    if (!parsed) return std::nullopt;
+    return std::make_pair(json::str(json::object(*parsed, "last_time_phone"), "bleId"),
+                          json::str(json::object(*parsed, "last_time_pad"), "bleId"));
+}
+
+DatabaseReadResult readAccountDatabase(const std::string& filePath) {
     const std::string path = filePath + "/Config.db";
+    DatabaseReadResult result;
+    std::error_code ec;
+    if (!std::filesystem::exists(path, ec) && !ec) {
+        result.state = DatabaseState::Missing;
+        result.openFailed = true;
+        result.detail = std::to_string(SQLITE_CANTOPEN);
+        return result;
+    }
     ConnectionGuard connection;
     // Read-only: a missing file must not be created in the PC suite's folder.
-    const int rc = sqlite3_open_v2(path.c_str(), &connection.db, SQLITE_OPEN_READONLY, nullptr);
+    const int openRc = sqlite3_open_v2(path.c_str(), &connection.db, SQLITE_OPEN_READONLY, nullptr);
+    if (openRc != SQLITE_OK) {
+        result.openFailed = true;
+        result.detail = std::to_string(openRc);
+        return result;
+    }
+    // Wait a moment for a writer of the PC suite instead of failing at once, but never let a
+    // damaged file keep this thread (or its memory) for long.
+    const auto busy = Config::current().databaseBusyTimeout;
+    sqlite3_busy_timeout(connection.db, static_cast<int>(busy.count()));
+    sqlite3_limit(connection.db, SQLITE_LIMIT_LENGTH, kMaxSqliteValueBytes);
+    auto deadline = std::chrono::steady_clock::now() + busy + kMaxReadWork;
+    sqlite3_progress_handler(
+        connection.db, 1000,
+        [](void* end) -> int {
+            return std::chrono::steady_clock::now() > *static_cast<std::chrono::steady_clock::time_point*>(end);
+        },
+        &deadline);
+
+    // One read transaction: the account and its directories come from the same state of the
+    // file, and a writer cannot slip in between the two statements.
+    std::string error;
+    int rc = sqlite3_exec(connection.db, "BEGIN;", nullptr, nullptr, nullptr);
+    AccountRows user(true);
+    if (rc == SQLITE_OK) rc = runStatement(connection.db, kUserStatement, {}, user, error);
+    else error = sqlite3_errmsg(connection.db);
     if (rc != SQLITE_OK) {
-        Utils::mPrintlog("[dataBaseRead] Database file Config.db open failed due to : " + std::to_string(rc) +
+        result.state = isLockCode(rc) ? DatabaseState::Busy : DatabaseState::Unreadable;
+        result.failedTable = "User";
+        result.detail = error;
+        return result;
+    }
+    databaseParam next = dataInstance().get();
+    user.applyTo(next);
+    AccountRows softwareSet(false);
+    result.softwareSetRead = runStatement(connection.db, kSoftwareSetStatement, next.openid, softwareSet, error) == SQLITE_OK;
+    if (!result.softwareSetRead) {
+        result.failedTable = "SoftwareSet";
+        result.detail = error;
+    }
+    sqlite3_exec(connection.db, "COMMIT;", nullptr, nullptr, nullptr);
+
+    dataInstance().update([&](databaseParam& p) {
+        user.applyTo(p);
+        if (result.softwareSetRead) softwareSet.applyTo(p);
+    });
+    result.state = DatabaseState::Good;
+    databaseUpdate.store(result.softwareSetRead);
+    return result;
+}
+
+void logDatabaseRead(const DatabaseReadResult& result) {
+    if (result.openFailed) {
+        Utils::mPrintlog("[dataBaseRead] Database file Config.db open failed due to : " + result.detail +
                          " current time is: " + Utils::getNowTime());
         return;
     }
     Utils::mPrintlog("[dataBaseRead]  DataBase file Config.db open success");
-    // Wait a moment for a writer of the PC suite instead of failing at once.
-    const auto busy = Config::current().databaseBusyTimeout;
-    sqlite3_busy_timeout(connection.db, static_cast<int>(busy.count()));
-
-    if (!queryTables(connection.db, "User", false, "")) return;
-    const bool softwareSetRead =
-        queryTables(connection.db, "SoftwareSet", false, dataInstance().get(&databaseParam::openid));
-    databaseUpdate.store(notifySSDP(softwareSetRead));
-}
-
-bool queryTables(sqlite3* db, const std::string& conditionQuery, bool /*openidNil*/, const std::string& openid) {
-    std::string statement;
-    if (conditionQuery == "User") statement = kUserStatement;
-    else if (conditionQuery == "SoftwareSet") statement = kSoftwareSetStatement;
-    return readDatabase(db, statement, conditionQuery == "User", openid);
-}
-
-bool readDatabase(sqlite3* db, const std::string& quertCondition, bool tableFlag, const std::string& boundValue) {
-    const std::string failLine = std::string("[readDatabase] read database Table ") +
-                                 (tableFlag ? "User" : "SoftwareSet") + " failed";
-    auto fail = [&](const char* reason) {
-        Utils::mPrintlog(failLine);
-        if (reason != nullptr) Utils::mPrintlog(std::string("[readDatabase] SQLite says: ") + reason);
-        return false;
-    };
-    if (db == nullptr) return fail(nullptr);
-
-    StatementGuard statement;
-    // An empty text prepares to no statement at all, which counts as a failure too.
-    if (sqlite3_prepare_v2(db, quertCondition.c_str(), -1, &statement.stmt, nullptr) != SQLITE_OK ||
-        statement.stmt == nullptr)
-        return fail(sqlite3_errmsg(db));
-    if (sqlite3_bind_parameter_count(statement.stmt) > 0 &&
-        sqlite3_bind_text(statement.stmt, 1, boundValue.data(), static_cast<int>(boundValue.size()),
-                          SQLITE_TRANSIENT) != SQLITE_OK)
-        return fail(sqlite3_errmsg(db));
-
-    // Rows are gathered first and applied in one step, so that readers never see half a
-    // row and a read that breaks off (locked or damaged file) changes nothing.
-    bool anyRow = false;
-    std::string openid, second, third;
-    std::optional<std::string> phone;  // the last non-NULL phone: a NULL one changes nothing
-    int rc;
-    while ((rc = sqlite3_step(statement.stmt)) == SQLITE_ROW) {
-        anyRow = true;
-        openid = columnText(statement.stmt, 0);
-        third = columnText(statement.stmt, 2);
-        if (tableFlag) {
-            if (sqlite3_column_type(statement.stmt, 1) != SQLITE_NULL)
-                phone = Utils::paramAddMask(columnText(statement.stmt, 1));
-        } else {
-            second = columnText(statement.stmt, 1);
-        }
+    if (!result.failedTable.empty()) {
+        Utils::mPrintlog("[readDatabase] read database Table " + result.failedTable + " failed");
+        Utils::mPrintlog("[readDatabase] SQLite says: " + result.detail);
     }
-    if (rc != SQLITE_DONE) return fail(sqlite3_errmsg(db));
+    if (result.state == DatabaseState::Good) notifySSDP(result.softwareSetRead);
+}
 
-    dataInstance().update([&](databaseParam& p) {
-        if (tableFlag) {
-            if (anyRow) {
-                p.openid = openid;
-                p.token = third;
-                if (phone) p.Phone = *phone;
-                p.lastOpenId = p.openid;
-                p.lastToken = p.token;
-            } else {
-                // Nobody is signed in.
-                p.openid.clear();
-                p.Phone.clear();
-                p.token.clear();
-            }
-        } else if (anyRow) {
-            p.openid = openid;
-            p.configDir = second;
-            p.storageDir = third;
-        }
-    });
-    return true;
+DatabaseReadResult dataBaseRead(const std::string& filePath) {
+    const DatabaseReadResult result = readAccountDatabase(filePath);
+    logDatabaseRead(result);
+    return result;
 }
 
 bool notifySSDP(bool retDBRead) {
@@ -207,11 +284,7 @@ std::string getPcsuiteDeviceInfo() {
         Utils::mPrintlog("[getPcsuiteDeviceInfo] Read file path is: " + path);
         std::string content;
         Utils::readFile(path, content);
-        if (!content.empty()) {
-            const auto parsed = json::parse(content);
-            const std::string deviceId = parsed ? json::str(*parsed, "newDeviceId") : std::string();
-            dataInstance().set(&databaseParam::pcDeviceId, deviceId);
-        }
+        if (!content.empty()) dataInstance().set(&databaseParam::pcDeviceId, deviceIdFromConfigText(content));
         if (dataInstance().get(&databaseParam::pcDeviceId).empty())
             Utils::mPrintlog("[getPcsuiteDeviceId] Device ID retrieval failed.");
     }
@@ -224,14 +297,14 @@ void updateHistoryDevice() {
     std::string content;
     Utils::readFile(path, content);
     if (content.empty()) return;
-    const auto parsed = json::parse(content);
-    if (!parsed) {
+    const auto ids = historyIdsFromText(content);
+    if (!ids) {
         // A half-written file says nothing about the last devices: keep what we know.
         Utils::mPrintlog("[updateHistoryDevice] history file is not valid JSON, ids kept");
         return;
     }
-    const std::string phoneId = json::str(json::object(*parsed, "last_time_phone"), "bleId");
-    const std::string padId = json::str(json::object(*parsed, "last_time_pad"), "bleId");
+    const std::string& phoneId = ids->first;
+    const std::string& padId = ids->second;
     dataInstance().update([&](databaseParam& p) {
         p.historyPhoneId = phoneId;
         p.historyPadId = padId;

@@ -2,12 +2,85 @@
 // historyPhone.json) into the shared account record, and the paths of those files.
 #pragma once
 
+#include <cstddef>
 #include <optional>
 #include <string>
+#include <string_view>
+#include <utility>
 
-struct sqlite3;
+#include "account/DataInstance.h"
 
 namespace kesu {
+
+// ---- Pure readers of the PC suite's data (no files, no logging) ----------------------------
+
+// Longest account value taken from the database; a longer one is not a real open id, token or
+// folder and reads as "".
+inline constexpr std::size_t kMaxAccountValueBytes = 64 * 1024;
+
+// One value of a result row as SQLite stores it, with its bytes (numbers in their text form).
+struct ColumnValue {
+    enum class Type { Null, Integer, Float, Text, Blob };
+    Type type = Type::Null;
+    std::string bytes;
+};
+
+// The value as an account field: nullopt for NULL; numbers as their text; text and blobs as
+// they are when they are valid UTF-8 without NUL and at most kMaxAccountValueBytes long, else
+// "" (a value nobody can use is no value).
+std::optional<std::string> accountText(const ColumnValue& value);
+
+// Folds the rows of one statement into the account record the way a read does: the last row
+// wins, a NULL phone changes nothing, and an empty User table signs out (the directories and
+// the last values stay). SoftwareSet rows set the open id and the directories.
+class AccountRows {
+public:
+    explicit AccountRows(bool userTable) : userTable_(userTable) {}
+    void add(const ColumnValue& first, const ColumnValue& second, const ColumnValue& third);
+    void applyTo(databaseParam& p) const;
+
+private:
+    bool userTable_;
+    bool anyRow_ = false;
+    std::string first_, second_, third_;
+    std::optional<std::string> phone_;  // the last non-NULL phone, masked
+};
+
+// "newDeviceId" of config.json; "" when the text is not JSON or has no such string.
+std::string deviceIdFromConfigText(std::string_view text);
+// ("last_time_phone"."bleId", "last_time_pad"."bleId") of historyPhone.json, "" for each one
+// absent; nullopt when the text is not JSON.
+std::optional<std::pair<std::string, std::string>> historyIdsFromText(std::string_view text);
+
+// ---- Reading the files ------------------------------------------------------------------------
+
+// How Config.db looked to the last read.
+enum class DatabaseState {
+    Missing,     // no file
+    Unreadable,  // cannot be opened, not a database, damaged, or without the User table
+    Busy,        // another writer held its lock longer than Config::databaseBusyTimeout
+    Good,        // the account was read
+};
+
+struct DatabaseReadResult {
+    DatabaseState state = DatabaseState::Unreadable;
+    bool openFailed = false;       // the file could not even be opened
+    bool softwareSetRead = false;  // the directories were read too
+    std::string failedTable;       // "User" or "SoftwareSet" when its statement failed
+    std::string detail;            // why it failed (SQLite's words or its code)
+};
+
+// Reads the account and its directories from `filePath` + "/Config.db" into the record, in
+// one read transaction applied in one step, and logs nothing. The file is opened read-only;
+// a locked file is waited for Config::databaseBusyTimeout, and a damaged one cannot hold the
+// read for more than a few seconds beyond that. Unless the state is Good the record is
+// unchanged. Without a SoftwareSet table (or row) the account is read, the directories not.
+DatabaseReadResult readAccountDatabase(const std::string& filePath);
+
+// readAccountDatabase with its log lines; sets the flag returned by retGet().
+DatabaseReadResult dataBaseRead(const std::string& filePath);
+// The log lines of a finished read: the open, a failed statement, the account summary.
+void logDatabaseRead(const DatabaseReadResult& result);
 
 // The library base below which the PC suite keeps its data, stored in `HomePathsand`.
 // Returns true when the service runs sandboxed (never on Linux: the base is then always
@@ -24,22 +97,6 @@ void FilePathget(std::string& fileStringPath);
 // Paths of the PC suite's JSON files.
 std::string pcsuiteConfigFilePath();   // .../pcsuite/config.json
 std::string historyPhoneFilePath();    // .../pcsuite/historyPhone.json
-
-// Reads the signed-in account and its directories from `filePath` + "/Config.db" into the
-// record and sets the flag returned by retGet(). The file is opened read-only and closed
-// again; when it cannot be read the record keeps its values.
-void dataBaseRead(const std::string& filePath);
-
-// Runs the statement of `conditionQuery` ("User" or "SoftwareSet"; another name gives an
-// empty statement, which fails). `openidNil` is unused; `openid` selects the SoftwareSet row.
-bool queryTables(sqlite3* db, const std::string& conditionQuery, bool openidNil, const std::string& openid);
-
-// Runs one statement (tableFlag: the "User" statement) and copies its rows into the record,
-// the last row winning. `boundValue` fills the statement's parameter, if it has one.
-// Returns false when the statement cannot be prepared or its rows cannot be read; then the
-// record is unchanged.
-bool readDatabase(sqlite3* db, const std::string& quertCondition, bool tableFlag,
-                  const std::string& boundValue = {});
 
 // Logs the account summary when `retDBRead` is true; returns it unchanged.
 bool notifySSDP(bool retDBRead);

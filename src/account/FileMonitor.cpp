@@ -1,7 +1,9 @@
 // The modification-time poll of Config.db and what a change sets off.
 #include "account/FileMonitor.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
@@ -85,10 +87,23 @@ void FileMonitor::loop() {
     }
 }
 
+std::optional<DatabaseState> FileMonitor::state() const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return state_;
+}
+
 void FileMonitor::runPass() {
     const std::string path = databaseFilePath_ + "/" + kDatabaseFile;
-    if (!fileExist(path)) {
-        Utils::mPrintlog("[fileMonitorStart] Database file :" + path + " is lost ，please fix it");
+    const auto identity = fileIdentity(path);
+    if (!identity) {
+        const int error = errno;
+        if (error != ENOENT && error != ENOTDIR) {
+            // There is something we may not examine: the account stays as it is, and the file
+            // is read again once it can be examined.
+            lastIdentity_.reset();
+            enterState(DatabaseState::Unreadable, std::strerror(error));
+            return;
+        }
         dataInstance().update([](databaseParam& p) {
             p.openid.clear();
             p.Phone.clear();
@@ -96,31 +111,36 @@ void FileMonitor::runPass() {
             p.storageDir.clear();
             p.token.clear();
         });
-        fileLost_ = true;
+        lastIdentity_.reset();
+        enterState(DatabaseState::Missing, {});
         return;
     }
-    bool mustRead = fileAttributeGet(databaseFilePath_, lastModifyTime, firstRead, databaseReadTimes);
-    if (!mustRead && fileLost_) {
-        // The file came back with the modification time it had before (a copy that keeps
-        // times, a restored backup): the account was cleared meanwhile, so read it again.
-        if (auto time = modificationTime(path)) {
-            Utils::mPrintlog("[fileMonitorStart] Database file :" + path + " is back, reading it again");
-            lastModifyTime = *time;
-            ++databaseReadTimes;
-            mustRead = true;
-        }
-    }
-    if (mustRead) {
-        fileLost_ = false;
+    // A file back after a loss, or another file renamed over it, is read even when it keeps
+    // the modification time of the last one.
+    const bool timeChanged = fileAttributeGet(databaseFilePath_, lastModifyTime, firstRead, databaseReadTimes);
+    if (timeChanged || identity != lastIdentity_) {
+        lastIdentity_ = identity;
         readAndAnnounce();
+        return;
     }
+    if (state() != DatabaseState::Busy) return;
+    // The last read found the file locked: try again, quietly unless that changes something.
+    const DatabaseReadResult result = readAccountDatabase(databaseFilePath_);
+    if (result.state == DatabaseState::Busy) return;
+    logDatabaseRead(result);
+    enterState(result.state, result.detail);
+    if (result.state == DatabaseState::Good) announce();
 }
 
 void FileMonitor::readAndAnnounce() {
     Utils::mPrintlog("[fileMonitorStart] DataBase file changed recently at time stamp: " +
                      getLocalDate(dateDescription(lastModifyTime)));
-    dataBaseRead(databaseFilePath_);
+    const DatabaseReadResult result = dataBaseRead(databaseFilePath_);
+    enterState(result.state, result.detail);
+    announce();
+}
 
+void FileMonitor::announce() {
     const std::string openid = dataInstance().get(&databaseParam::openid);
     if (!openid.empty()) {
         // Ask the local push client for its client id; the answer arrives on its own way.
@@ -132,11 +152,51 @@ void FileMonitor::readAndAnnounce() {
     EventPublisher::instance().notifySubscribers("AccountChangeEvent");
 }
 
-bool FileMonitor::fileExist(const std::string& filePath) {
-    std::error_code ec;
-    if (std::filesystem::exists(filePath, ec)) return true;
-    Utils::mPrintlog("[fileExist] File lost. File :" + filePath + " is not exist");
-    return false;
+void FileMonitor::enterState(DatabaseState next, const std::string& detail) {
+    {
+        std::lock_guard<std::mutex> lock(mutex_);
+        if (state_ == next) return;
+        state_ = next;
+    }
+    const std::string file = "[fileMonitorStart] Database file :" + databaseFilePath_ + "/" + kDatabaseFile;
+    switch (next) {
+        case DatabaseState::Missing:
+            Utils::mPrintlog("[fileExist] File lost. File :" + databaseFilePath_ + "/" + kDatabaseFile +
+                             " is not exist");
+            Utils::mPrintlog(file + " is lost ，please fix it");
+            break;
+        case DatabaseState::Unreadable:
+            Utils::mPrintlog(file + " cannot be read (" + detail + "), the account is kept");
+            break;
+        case DatabaseState::Busy:
+            Utils::mPrintlog(file + " is locked by another writer, the account is kept until it can be read");
+            break;
+        case DatabaseState::Good:
+            Utils::mPrintlog(file + " is readable");
+            break;
+    }
+}
+
+std::optional<FileMonitor::FileIdentity> FileMonitor::fileIdentity(const std::string& path) {
+    struct stat st {};
+    if (::stat(path.c_str(), &st) != 0) return std::nullopt;
+    FileIdentity id;
+    id.device = static_cast<std::uint64_t>(st.st_dev);
+    id.inode = static_cast<std::uint64_t>(st.st_ino);
+    id.size = static_cast<std::int64_t>(st.st_size);
+    id.modifiedNs = static_cast<std::int64_t>(st.st_mtim.tv_sec) * 1'000'000'000 + st.st_mtim.tv_nsec;
+    id.changedNs = static_cast<std::int64_t>(st.st_ctim.tv_sec) * 1'000'000'000 + st.st_ctim.tv_nsec;
+    // Two commits within one tick of the file-system clock may leave size and times alike;
+    // the counter at offset 24 of the header tells them apart.
+    const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
+    if (fd >= 0) {
+        unsigned char counter[4];
+        if (::pread(fd, counter, sizeof counter, 24) == static_cast<ssize_t>(sizeof counter))
+            id.changeCounter = (std::uint32_t{counter[0]} << 24) | (std::uint32_t{counter[1]} << 16) |
+                               (std::uint32_t{counter[2]} << 8) | std::uint32_t{counter[3]};
+        ::close(fd);
+    }
+    return id;
 }
 
 bool FileMonitor::fileAttributeGet(const std::string& directory, TimePoint& lastFileChange, bool& isFirstRead,

@@ -1,13 +1,20 @@
-// Watches the PC suite's account database Config.db by its modification time and, when it
-// changes (and once at start), re-reads the account, asks the local push client for its
-// client id and publishes "AccountChangeEvent".
+// Watches the PC suite's account database Config.db by the file's identity (device, inode,
+// size, modification and change times, SQLite's change counter) and, when it changes (and
+// once at start), re-reads the account, asks the local push client for its client id and
+// publishes "AccountChangeEvent". The file's state (missing, unreadable, busy, good) is
+// logged once per change of state, not on every pass; a read that found the file locked is
+// tried again on the next pass until it gets through.
 #pragma once
 
 #include <chrono>
 #include <condition_variable>
+#include <cstdint>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <thread>
+
+#include "account/DataGet.h"
 
 namespace kesu {
 
@@ -33,9 +40,19 @@ public:
     void runPass();
 
     const std::string& databaseFilePath() const { return databaseFilePath_; }
+    // The file's state as the last pass saw it; nullopt before the first pass.
+    std::optional<DatabaseState> state() const;
 
-    // True when something (file or folder) exists at the path; logs the loss otherwise.
-    static bool fileExist(const std::string& filePath);
+    // What tells one version of the file from another. Replacing the file by renaming a new
+    // one over it changes the inode even when size and times are kept.
+    struct FileIdentity {
+        std::uint64_t device = 0, inode = 0;
+        std::int64_t size = 0, modifiedNs = 0, changedNs = 0;
+        std::uint32_t changeCounter = 0;  // SQLite's header counter, bumped by every commit
+        bool operator==(const FileIdentity&) const = default;
+    };
+    // The identity of the file at `path`; nullopt (with errno set) when it cannot be examined.
+    static std::optional<FileIdentity> fileIdentity(const std::string& path);
     // Whether Config.db in `directory` must be read now: its modification time differs from
     // `lastFileChange`, or this is the first read. A file that cannot be examined (removed
     // since the existence check) counts as no change.
@@ -50,6 +67,9 @@ public:
 private:
     void loop();
     void readAndAnnounce();
+    // Records the state and logs it when it differs from the last one.
+    void enterState(DatabaseState next, const std::string& detail);
+    void announce();
 
     const std::string databaseFilePath_;
     const std::chrono::milliseconds period_;
@@ -59,7 +79,8 @@ private:
     TimePoint lastModifyTime;
     bool firstRead = true;
     int databaseReadTimes = 0;
-    bool fileLost_ = false;
+    std::optional<FileIdentity> lastIdentity_;  // none while the file is missing
+    std::optional<DatabaseState> state_;        // written by passes, read by state() (mutex_)
 
     std::mutex lifecycle_;  // start() and stop() one at a time
     mutable std::mutex mutex_;

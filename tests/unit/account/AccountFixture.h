@@ -42,13 +42,16 @@ protected:
 
     // Creates the file anew with both tables, then runs `rows` (INSERT statements).
     static void writeDatabase(const std::string& path, const std::string& rows) {
+        writeDatabaseScript(path,
+                            "CREATE TABLE User (openid TEXT, phone TEXT, token TEXT);"
+                            "CREATE TABLE SoftwareSet (openid TEXT, configDir TEXT, storageDir TEXT);" +
+                                rows);
+    }
+    // Creates the file anew and runs `script` on it.
+    static void writeDatabaseScript(const std::string& path, const std::string& script) {
         std::filesystem::remove(path);
         sqlite3* db = nullptr;
         ASSERT_EQ(sqlite3_open(path.c_str(), &db), SQLITE_OK);
-        const std::string script =
-            "CREATE TABLE User (openid TEXT, phone TEXT, token TEXT);"
-            "CREATE TABLE SoftwareSet (openid TEXT, configDir TEXT, storageDir TEXT);" +
-            rows;
         char* error = nullptr;
         const int rc = sqlite3_exec(db, script.c_str(), nullptr, nullptr, &error);
         const std::string message = error ? error : "";

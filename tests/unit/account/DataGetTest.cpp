@@ -147,6 +147,26 @@ TEST_F(DataGetTest, UnreadableDatabaseKeepsThePreviousAccount) {
     EXPECT_FALSE(retGet());
 }
 
+TEST(AccountText, OnlyUsableTextReachesTheRecord) {
+    using T = ColumnValue::Type;
+    const std::string longest(kMaxAccountValueBytes, 'a');
+    const struct {
+        ColumnValue value;
+        std::optional<std::string> expected;
+    } cases[] = {
+        {{T::Null, ""}, std::nullopt},
+        {{T::Integer, "12345"}, "12345"},
+        {{T::Float, "2.5"}, "2.5"},
+        {{T::Text, "o\xC3\xA9id"}, "o\xC3\xA9id"},
+        {{T::Blob, "oid-b"}, "oid-b"},
+        {{T::Blob, "\xFF\xFE"}, ""},
+        {{T::Text, std::string("a\0b", 3)}, ""},
+        {{T::Text, longest}, longest},
+        {{T::Text, longest + "a"}, ""},
+    };
+    for (const auto& c : cases) EXPECT_EQ(accountText(c.value), c.expected) << c.value.bytes.substr(0, 16);
+}
+
 TEST_F(DataGetTest, OpenIdWithQuotesIsMatchedLiterally) {
     writeDatabase(dbFile(), "INSERT INTO User VALUES ('o''brien\"x', '13812345678', 't');"
                             "INSERT INTO SoftwareSet VALUES ('o''brien\"x', '/cfg/ob', '/store/ob');");

@@ -8,6 +8,9 @@
 
 #include <nlohmann/json.hpp>
 
+#include <cstdint>
+#include <functional>
+
 #include "account/DataGet.h"
 #include "support/UdpCatcher.h"
 #include "unit/account/AccountFixture.h"
@@ -35,8 +38,19 @@ protected:
         const timespec times[2] = {{seconds, 0}, {seconds, 0}};
         ASSERT_EQ(::utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
     }
+    // The monitor's state lines so far: one per change of the file's state.
+    static int stateLines() {
+        const std::string log = todaysLog();
+        const std::string line = "[fileMonitorStart] Database file :";
+        int n = 0;
+        for (auto at = log.find(line); at != std::string::npos; at = log.find(line, at + 1)) ++n;
+        return n;
+    }
 
     int changes() { return events->count("AccountChangeEvent"); }
+    void writeBytes(const std::string& bytes) {
+        env.dir().write("home/Library/Application Support/pcsuite/DataBase/Config.db", bytes);
+    }
     // A datagram already queued (loopback delivers during the send), if any.
     std::optional<std::string> sent() { return pushClient.receive(0ms); }
 
@@ -104,6 +118,163 @@ TEST_F(FileMonitorTest, PassesFollowTheDatabaseFile) {
     EXPECT_EQ(dataInstance().get().openid, "");
     EXPECT_FALSE(sent());
     EXPECT_EQ(todaysLog().find("tok-SECRET-1"), std::string::npos);
+}
+
+// Every way Config.db can go wrong, each entered from a good file and left back to it: the
+// account the service sees, and one log line per change of state, none on the passes after.
+TEST_F(FileMonitorTest, BadFilesKeepTheServiceGoingAndAreLoggedOncePerChange) {
+    env.config().databaseBusyTimeout = 0ms;
+    const std::string untyped = "CREATE TABLE User (openid, phone, token);"
+                                "CREATE TABLE SoftwareSet (openid, configDir, storageDir);";
+    struct Case {
+        const char* name;
+        std::function<void()> make;
+        DatabaseState state;
+        std::string openid;
+    };
+    const Case cases[] = {
+        {"missing", [&] { std::filesystem::remove(dbFile()); }, DatabaseState::Missing, ""},
+        {"empty", [&] { writeBytes(""); }, DatabaseState::Unreadable, "oid-1"},
+        {"random bytes",
+         [&] {
+             std::string junk(8192, '\0');
+             std::uint32_t x = 2463534242u;
+             for (char& c : junk) c = static_cast<char>(x ^= x << 13, x ^= x >> 17, x ^= x << 5);
+             writeBytes(junk);
+         },
+         DatabaseState::Unreadable, "oid-1"},
+        {"no User table",
+         [&] { writeDatabaseScript(dbFile(), "CREATE TABLE Other (x TEXT);"); },
+         DatabaseState::Unreadable, "oid-1"},
+        {"User without the columns",
+         [&] { writeDatabaseScript(dbFile(), "CREATE TABLE User (name TEXT);"); },
+         DatabaseState::Unreadable, "oid-1"},
+        {"integer open id",
+         [&] { writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (12345, 1, 2.5);"); },
+         DatabaseState::Good, "12345"},
+        {"blob open id that is not text",
+         [&] {
+             writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (X'FF00FE', X'00', 'tok');");
+         },
+         DatabaseState::Good, ""},
+        {"blob open id that is text",
+         [&] {
+             writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (X'6F69642D62', NULL, NULL);");
+         },
+         DatabaseState::Good, "oid-b"},
+        {"NULLs", [&] { writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (NULL, NULL, NULL);"); },
+         DatabaseState::Good, ""},
+    };
+
+    std::time_t stamp = 1'700'000'000;
+    auto good = [&] {
+        writeDatabase(dbFile(), kSignedInRows);
+        setModified(dbFile(), ++stamp);
+    };
+    good();
+    FileMonitor monitor(dbDir());
+    monitor.runPass();
+    ASSERT_EQ(monitor.state(), DatabaseState::Good);
+    EXPECT_EQ(stateLines(), 1);  // the first look counts as a change
+
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        const bool bad = c.state != DatabaseState::Good;
+        const int linesBefore = stateLines();
+        c.make();
+        if (std::filesystem::exists(dbFile())) setModified(dbFile(), ++stamp);
+        monitor.runPass();
+        EXPECT_EQ(monitor.state(), c.state);
+        EXPECT_EQ(dataInstance().get().openid, c.openid);
+        EXPECT_EQ(stateLines(), linesBefore + (bad ? 1 : 0));
+        const std::size_t logSize = todaysLog().size();
+        monitor.runPass();
+        monitor.runPass();
+        EXPECT_EQ(todaysLog().size(), logSize) << "a pass in an unchanged state logged";
+        EXPECT_EQ(dataInstance().get().openid, c.openid);
+
+        good();
+        monitor.runPass();
+        EXPECT_EQ(monitor.state(), DatabaseState::Good);
+        EXPECT_EQ(dataInstance().get().openid, "oid-1");
+        EXPECT_EQ(dataInstance().get().configDir, "/cfg/one");
+        EXPECT_EQ(stateLines(), linesBefore + (bad ? 2 : 0));
+    }
+}
+
+// The PC suite writes a new account and keeps the file locked (for seconds in real life; the
+// configured busy wait keeps it short here): each read gives up after the busy wait keeping
+// the old account, later passes try again without logging, and the account is read as soon
+// as the lock goes, without the file changing again.
+TEST_F(FileMonitorTest, LockedDatabaseKeepsTheAccountUntilTheLockGoes) {
+    env.config().databaseBusyTimeout = 20ms;
+    writeDatabase(dbFile(), kSignedInRows);
+    setModified(dbFile(), 1'700'000'000);
+    FileMonitor monitor(dbDir());
+    monitor.runPass();
+    ASSERT_EQ(dataInstance().get().openid, "oid-1");
+    ASSERT_TRUE(sent());
+
+    sqlite3* writer = nullptr;
+    ASSERT_EQ(sqlite3_open(dbFile().c_str(), &writer), SQLITE_OK);
+    ASSERT_EQ(sqlite3_exec(writer,
+                           "UPDATE User SET openid = 'oid-2', token = 'tok-2';"
+                           "UPDATE SoftwareSet SET openid = 'oid-2' WHERE openid = 'oid-1';"
+                           "BEGIN EXCLUSIVE;",
+                           nullptr, nullptr, nullptr),
+              SQLITE_OK);
+    const int lines = stateLines();
+    monitor.runPass();
+    EXPECT_EQ(monitor.state(), DatabaseState::Busy);
+    EXPECT_EQ(dataInstance().get().openid, "oid-1");
+    EXPECT_EQ(dataInstance().get().token, "tok-SECRET-1");
+    EXPECT_EQ(stateLines(), lines + 1);
+    const int eventsWhileLocked = changes();
+    while (sent()) {
+    }
+    const std::size_t logSize = todaysLog().size();
+    monitor.runPass();
+    monitor.runPass();
+    EXPECT_EQ(todaysLog().size(), logSize);
+    EXPECT_EQ(changes(), eventsWhileLocked);
+    EXPECT_EQ(dataInstance().get().openid, "oid-1");
+
+    const auto lockedIdentity = FileMonitor::fileIdentity(dbFile());
+    ASSERT_EQ(sqlite3_exec(writer, "ROLLBACK;", nullptr, nullptr, nullptr), SQLITE_OK);
+    sqlite3_close(writer);
+    ASSERT_EQ(FileMonitor::fileIdentity(dbFile()), lockedIdentity);  // only the retry can see it
+    monitor.runPass();
+    EXPECT_EQ(monitor.state(), DatabaseState::Good);
+    const databaseParam p = dataInstance().get();
+    EXPECT_EQ(p.openid, "oid-2");
+    EXPECT_EQ(p.token, "tok-2");
+    EXPECT_EQ(p.configDir, "/cfg/one");
+    EXPECT_EQ(stateLines(), lines + 2);
+    EXPECT_EQ(changes(), eventsWhileLocked + 1);
+    const auto query = sent();
+    ASSERT_TRUE(query);
+    EXPECT_EQ(nlohmann::json::parse(*query)["openId"], "oid-2");
+}
+
+// A new file renamed over the old one with the same size and modification time is read.
+TEST_F(FileMonitorTest, FileReplacedByRenameIsRead) {
+    writeDatabase(dbFile(), kSignedInRows);
+    setModified(dbFile(), 1'700'000'000);
+    FileMonitor monitor(dbDir());
+    monitor.runPass();
+    ASSERT_EQ(dataInstance().get().openid, "oid-1");
+
+    const std::string next = dbDir() + "/Config.db.new";
+    writeDatabase(next, "INSERT INTO User VALUES ('oid-2', '13812345678', 'tok-SECRET-2');"
+                        "INSERT INTO SoftwareSet VALUES ('oid-2', '/cfg/two', '/store/two');");
+    setModified(next, 1'700'000'000);
+    ASSERT_EQ(std::filesystem::file_size(next), std::filesystem::file_size(dbFile()));
+    std::filesystem::rename(next, dbFile());
+    monitor.runPass();
+    EXPECT_EQ(dataInstance().get().openid, "oid-2");
+    EXPECT_EQ(dataInstance().get().token, "tok-SECRET-2");
+    EXPECT_EQ(dataInstance().get().configDir, "/cfg/two");
+    EXPECT_EQ(changes(), 2);
 }
 
 TEST_F(FileMonitorTest, AttributesOfAVanishedFileAreNoChange) {
