@@ -224,8 +224,16 @@ TEST(TimeHelpers, FormatsParsesAndCountsDays) {
     EXPECT_EQ(Utils::stringToTimestamp("2026-03-28 12:34:56.789"),
               std::chrono::floor<std::chrono::seconds>(t->time_since_epoch()).count());
     for (const char* bad : {"", "2026-03-28 12:34:56", "2026-02-30 00:00:00.000", "2026-13-01 00:00:00.000",
-                            "2026-03-28T12:34:56.789", "2026-03-28 12:34:56.789x", "abcd-ef-gh ij:kl:mn.opq"})
+                            "2026-03-28T12:34:56.789", "2026-03-28 12:34:56.789x", "abcd-ef-gh ij:kl:mn.opq",
+                            // beyond what the clock can hold (1678 to 2262)
+                            "9026-11-26 10:00:00.000", "0001-01-01 00:00:00.000"})
         EXPECT_EQ(Utils::stringToTimestamp(bad), 0) << bad;
+
+    EXPECT_FALSE(timeutil::parseLocalDate("9999-12-31"));
+    EXPECT_TRUE(timeutil::parseLocalDate("2200-12-31"));
+    // Times further apart than the clock's nanoseconds reach are still counted.
+    EXPECT_EQ(timeutil::wholeDays(*timeutil::parseLocalDate("1700-01-01"), *timeutil::parseLocalDate("2026-01-01")),
+              119069);
 
     // Across the spring clock change a calendar day is 23 hours.
     const auto before = *timeutil::parseLocal("2026-03-28 12:00:00.000");
