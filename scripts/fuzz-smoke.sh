@@ -2,7 +2,9 @@
 # Builds every libFuzzer target (tests/fuzz/*_fuzz.cpp) with clang into build-fuzz/, the
 # library instrumented as well, then runs each for a short while. Exits non-zero when a
 # target fails to build or finds a crash; the crashing input is kept in build-fuzz/artifacts.
-# FUZZ_SECONDS sets the run time per target (default 30).
+# FUZZ_SECONDS sets the run time per target (default 30). Each target starts from the inputs
+# it found before (build-fuzz/corpus/<target>, written to) and from the seeds kept in the
+# repository (tests/fuzz/corpus/<target>, only read).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
@@ -37,10 +39,12 @@ failed=()
 for t in "${targets[@]}"; do
   corpus="$dir/corpus/$t"
   mkdir -p "$corpus"
+  seeds=()
+  [ -d "tests/fuzz/corpus/$t" ] && seeds=("tests/fuzz/corpus/$t")
   echo "== fuzz $t (${seconds}s)"
   if ! HOME="$scratch/home" KESU_ROOT="$scratch/root" \
       "$dir/tests/fuzz/$t" -max_total_time="$seconds" -print_final_stats=1 \
-      -artifact_prefix="$dir/artifacts/$t-" "$corpus" >"$dir/$t.log" 2>&1; then
+      -artifact_prefix="$dir/artifacts/$t-" "$corpus" "${seeds[@]}" >"$dir/$t.log" 2>&1; then
     tail -n 60 "$dir/$t.log"
     failed+=("$t")
   else

@@ -4,11 +4,18 @@
 
 #include <chrono>
 #include <cstddef>
+#include <cstdint>
 #include <string>
 
 namespace kesu {
 
 struct Config {
+    // Largest size of one day's log file. A line that would take the file past it is not
+    // written there (one notice line says so); standard output still gets every line, and
+    // the next day's file starts afresh. Anyone on the LAN can make the service log, so the
+    // file must not grow without bound.
+    std::uintmax_t logFileMaxBytes = std::uintmax_t{64} << 20;
+
     // Local control API (this service's own HTTP server).
     std::string controlHost = "127.0.0.1";
     int controlPort = 9197;

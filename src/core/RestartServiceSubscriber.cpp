@@ -21,13 +21,17 @@ bool RestartServiceSubscriber::eventNotify(const std::string&) {
     return true;
 }
 
+std::optional<Utils::Clock::time_point> RestartServiceSubscriber::versionUpdateTime(const std::string& content) {
+    const auto parsed = json::parse(content);
+    const std::string updateText = parsed ? json::str(*parsed, "updateTime") : std::string();
+    return timeutil::parseLocal(updateText);
+}
+
 bool RestartServiceSubscriber::connServiceRunOutOfDate() {
     std::string content;
     Utils::readFile(rootedPath(Config::current().versionFile), content);
     if (content.empty()) return false;
-    const auto parsed = json::parse(content);
-    const std::string updateText = parsed ? json::str(*parsed, "updateTime") : std::string();
-    const auto updateTime = timeutil::parseLocal(updateText);
+    const auto updateTime = versionUpdateTime(content);
     const auto now = timeutil::parseLocal(Utils::getNowTime());
     if (!updateTime || !now) {
         Utils::mPrintlog("[RestartServiceSubscriber::connServiceRunOutOfDate] no valid updateTime, keep running");

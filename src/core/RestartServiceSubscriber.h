@@ -2,6 +2,10 @@
 // more than seven days ago (the version file's "updateTime"), unless a connection runs.
 #pragma once
 
+#include <optional>
+#include <string>
+
+#include "core/Utils.h"
 #include "events/IEventSubscriber.h"
 
 namespace kesu {
@@ -15,6 +19,8 @@ public:
     // True when the version file's update time lies more than `restartServiceDay` whole days
     // back. A missing, empty or unparsable file counts as current.
     bool connServiceRunOutOfDate();
+    // The "updateTime" of the version file's text; nothing when the text holds no valid one.
+    static std::optional<Utils::Clock::time_point> versionUpdateTime(const std::string& content);
 
     const int restartServiceDay = 7;
 };

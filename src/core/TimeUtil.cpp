@@ -1,5 +1,6 @@
 #include "core/TimeUtil.h"
 
+#include <chrono>
 #include <cstdio>
 #include <ctime>
 
@@ -26,6 +27,12 @@ std::string formatDate(const std::tm& tm) {
     return buf;
 }
 
+// The clock counts nanoseconds and so holds only the years 1678 to 2262. Times beyond that,
+// less a week of room for the day steps of wholeDays, do not parse: converting them would
+// overflow.
+constexpr std::time_t kClockSecondsLimit =
+    std::chrono::duration_cast<std::chrono::seconds>(Clock::duration::max()).count() - 7 * 86400;
+
 bool validDate(int y, int mo, int d) {
     return y >= 1 && y <= 9999 && mo >= 1 && mo <= 12 && d >= 1 && d <= 31;
 }
@@ -43,6 +50,7 @@ std::optional<Clock::time_point> makeLocal(int y, int mo, int d, int h, int mi, 
     // mktime normalises 31 February into March: such dates do not parse.
     if (secs == static_cast<std::time_t>(-1) && !(y == 1969 || y == 1970)) return std::nullopt;
     if (tm.tm_mday != d || tm.tm_mon != mo - 1) return std::nullopt;
+    if (secs > kClockSecondsLimit || secs < -kClockSecondsLimit) return std::nullopt;
     return Clock::from_time_t(secs) + std::chrono::milliseconds(ms);
 }
 
@@ -99,7 +107,8 @@ long long wholeDays(Clock::time_point from, Clock::time_point to) {
         tm.tm_isdst = -1;
         return Clock::from_time_t(std::mktime(&tm)) + fraction;
     };
-    long long n = std::chrono::duration_cast<std::chrono::hours>(to - from).count() / 24;
+    // In seconds: the distance of two far-apart times overflows the clock's nanoseconds.
+    long long n = (floorSeconds(to) - fromSecs) / 86400;
     while (n > 0 && shifted(n) > to) --n;
     while (shifted(n + 1) <= to) ++n;
     return n;

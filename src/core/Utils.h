@@ -9,6 +9,7 @@
 #include <map>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace kesu {
@@ -81,6 +82,9 @@ public:
     static bool openWifi();
     static std::string openWlanSetting();
     static void getConnectCenterUrl();
+    // The first "ConnectionCenterHost=..." entry (up to the next blank or line end) of the
+    // host override file's text; nothing when it has none.
+    static std::optional<std::string> parseSwitchHost(std::string_view content);
 
     // ---- Text conversions --------------------------------------------------------------
     static std::string uintToHexString(const std::string& value);

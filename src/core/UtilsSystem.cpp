@@ -320,32 +320,35 @@ std::string Utils::openWlanSetting() {
     return answer.dump(2);
 }
 
-void Utils::getConnectCenterUrl() {
-    const std::string path = rootedPath(Config::current().switchHostIni);
-    if (!isFileExist(path)) return;
-    std::string content;
-    readFile(path, content);
-
+std::optional<std::string> Utils::parseSwitchHost(std::string_view content) {
     std::regex expression;
     try {
         expression = std::regex(R"((ConnectionCenterHost=\S*))");
     } catch (const std::regex_error& e) {
         mPrintlog(std::string("[Utils::getConnectCenterUrl] regex Error: ") + e.what());
-        return;
+        return std::nullopt;
     }
     // A match never spans a line end, so the text is searched line by line.
-    std::string matched;
-    std::istringstream lines(content);
-    for (std::string line; matched.empty() && std::getline(lines, line);) {
+    std::istringstream lines{std::string(content)};
+    for (std::string line; std::getline(lines, line);) {
         if (line.size() > maxOverrideLineLength) continue;
         std::smatch match;
-        if (std::regex_search(line, match, expression)) matched = match[1].str();
+        if (std::regex_search(line, match, expression)) return match[1].str();
     }
-    if (matched.empty()) return;
+    return std::nullopt;
+}
 
-    mPrintlog("[Utils::getConnectCenterUrl] ConnectCenterUrl: " + matched);
+void Utils::getConnectCenterUrl() {
+    const std::string path = rootedPath(Config::current().switchHostIni);
+    if (!isFileExist(path)) return;
+    std::string content;
+    readFile(path, content);
+    const auto matched = parseSwitchHost(content);
+    if (!matched) return;
+
+    mPrintlog("[Utils::getConnectCenterUrl] ConnectCenterUrl: " + *matched);
     // Everything after the first "=" is the URL (a URL may itself hold "=").
-    const std::string value = matched.substr(matched.find('=') + 1);
+    const std::string value = matched->substr(matched->find('=') + 1);
     if (!value.empty()) setConnectCenterServerUrl(value);
     mPrintlog("[Utils::getConnectCenterUrl] connectCenterServerUrl: " + connectCenterServerUrl());
 }

@@ -122,6 +122,69 @@ TEST_F(LogFiles, MissingOrUnwritableLogDirectory) {
     EXPECT_NE(testing::internal::GetCapturedStdout().find("[logLoop] [LogTest] to stdout only"), std::string::npos);
 }
 
+std::size_t occurrences(const std::string& text, const std::string& part) {
+    std::size_t n = 0;
+    for (auto at = text.find(part); at != std::string::npos; at = text.find(part, at + 1)) ++n;
+    return n;
+}
+
+const std::string kCapNotice =
+    "[log] daily log file reached its size limit of 1000 bytes; further lines go to standard output only until "
+    "the next day's file\n";
+
+TEST_F(LogFiles, DailyFileStopsAtItsSizeLimitUntilTheNextDay) {
+    env.config().logFileMaxBytes = 1000;
+    {
+        ScopedClock clock(utc(2026, 12, 3, 10, 0, 0, 0));
+        testing::internal::CaptureStdout();
+        for (int i = 0; i < 20; ++i)
+            Utils::mPrintlog("[LogTest] line " + std::to_string(i) + " " + std::string(60, 'x'));
+        const std::string out = testing::internal::GetCapturedStdout();
+        EXPECT_NE(out.find("[LogTest] line 19 "), std::string::npos) << "standard output gets every line";
+        EXPECT_EQ(occurrences(out, kCapNotice), 1u) << out;
+    }
+    const std::string day3 = test::readAll(file("2026-12-03"));
+    EXPECT_LE(day3.size(), 1000u + 60u + kCapNotice.size()) << day3;
+    EXPECT_EQ(occurrences(day3, kCapNotice), 1u) << day3;
+    EXPECT_EQ(day3.substr(day3.size() - kCapNotice.size()), kCapNotice) << "the notice is the last line";
+    // The lines that fit are all there, in order; none after the first that did not fit.
+    const std::size_t written = occurrences(day3, "[LogTest] line ");
+    EXPECT_GE(written, 5u);
+    for (std::size_t i = 0; i < written; ++i)
+        EXPECT_NE(day3.find("[LogTest] line " + std::to_string(i) + " "), std::string::npos) << i;
+
+    {
+        ScopedClock clock(utc(2026, 12, 4, 0, 0, 0, 0));
+        Utils::mPrintlog("[LogTest] next day");
+    }
+    const std::string day4 = test::readAll(file("2026-12-04"));
+    EXPECT_NE(day4.find("[logLoop] [LogTest] next day\n"), std::string::npos) << day4;
+    EXPECT_EQ(day4.find("[log] daily log file"), std::string::npos);
+    EXPECT_EQ(test::readAll(file("2026-12-03")), day3);
+}
+
+TEST_F(LogFiles, RestartOnTheSameDayKeepsTheCap) {
+    env.config().logFileMaxBytes = 1000;
+    ScopedClock clock(utc(2026, 12, 3, 10, 0, 0, 0));
+    // The notice may leave the file below the limit: a later run still adds nothing.
+    Utils::mPrintlog("[LogTest] long " + std::string(650, 'x'));
+    Utils::mPrintlog("[LogTest] too long " + std::string(400, 'y'));
+    Utils::closeLog();
+    const std::string capped = test::readAll(file("2026-12-03"));
+    ASSERT_LT(capped.size() + 100, 1000u);
+    ASSERT_EQ(occurrences(capped, kCapNotice), 1u);
+    Utils::mPrintlog("[LogTest] short");
+    Utils::closeLog();
+    EXPECT_EQ(test::readAll(file("2026-12-03")), capped);
+
+    // A file already at the limit takes nothing, not even the notice.
+    const std::string full(1000, 'z');
+    std::ofstream(file("2026-12-03"), std::ios::trunc) << full;
+    Utils::mPrintlog("[LogTest] short");
+    Utils::closeLog();
+    EXPECT_EQ(test::readAll(file("2026-12-03")), full);
+}
+
 TEST_F(LogFiles, OldFilesGoAfterFourteenDays) {
     ScopedClock clock(utc(2026, 12, 20, 12, 0, 0, 0));
     const std::string dir = Utils::logDirectory();
@@ -161,8 +224,16 @@ TEST(TimeHelpers, FormatsParsesAndCountsDays) {
     EXPECT_EQ(Utils::stringToTimestamp("2026-03-28 12:34:56.789"),
               std::chrono::floor<std::chrono::seconds>(t->time_since_epoch()).count());
     for (const char* bad : {"", "2026-03-28 12:34:56", "2026-02-30 00:00:00.000", "2026-13-01 00:00:00.000",
-                            "2026-03-28T12:34:56.789", "2026-03-28 12:34:56.789x", "abcd-ef-gh ij:kl:mn.opq"})
+                            "2026-03-28T12:34:56.789", "2026-03-28 12:34:56.789x", "abcd-ef-gh ij:kl:mn.opq",
+                            // beyond what the clock can hold (1678 to 2262)
+                            "9026-11-26 10:00:00.000", "0001-01-01 00:00:00.000"})
         EXPECT_EQ(Utils::stringToTimestamp(bad), 0) << bad;
+
+    EXPECT_FALSE(timeutil::parseLocalDate("9999-12-31"));
+    EXPECT_TRUE(timeutil::parseLocalDate("2200-12-31"));
+    // Times further apart than the clock's nanoseconds reach are still counted.
+    EXPECT_EQ(timeutil::wholeDays(*timeutil::parseLocalDate("1700-01-01"), *timeutil::parseLocalDate("2026-01-01")),
+              119069);
 
     // Across the spring clock change a calendar day is 23 hours.
     const auto before = *timeutil::parseLocal("2026-03-28 12:00:00.000");
