@@ -114,9 +114,9 @@ int main(int argc, char** argv) {
             for (int i = 0; i < rounds; ++i) {
                 // A new address each round (the previous one goes in the same change).
                 const std::string address = "10.77.12." + std::to_string(10 + i);
-                std::string batch = "ip -batch - <<'EOF'\n";
-                if (!previous.empty()) batch += "addr del " + previous + "/24 dev kr0\n";
-                batch += "addr add " + address + "/24 dev kr0\nEOF";
+                std::string batch = "printf '";
+                if (!previous.empty()) batch += "addr del " + previous + "/24 dev kr0\\n";
+                batch += "addr add " + address + "/24 dev kr0\\n' | ip -batch -";
                 if (!shell(batch)) {
                     std::fprintf(stderr, "could not add %s\n", address.c_str());
                     break;
