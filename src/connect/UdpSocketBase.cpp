@@ -1,40 +1,79 @@
 #include "connect/UdpSocketBase.h"
 
-#include <asio/ip/address.hpp>
+#include <arpa/inet.h>
+#include <netdb.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <system_error>
 
 #include "core/Utils.h"
 
 namespace kesu {
 
-UdpSocketBase::~UdpSocketBase() { close(); }
+namespace {
 
-void UdpSocketBase::initClientSocket() {
-    std::lock_guard<std::mutex> lock(mutex_);
-    if (!socket) socket.emplace(io_);
+std::string systemMessage(int error) { return std::system_category().message(error); }
+
+// The peer for an address literal (IPv4 or IPv6), else the first IPv4 address of a host name.
+// Empty `error` on success.
+sockaddr_storage peerOf(const std::string& ip, std::uint16_t port, socklen_t& length, std::string& error) {
+    sockaddr_storage peer{};
+    auto* v4 = reinterpret_cast<sockaddr_in*>(&peer);
+    auto* v6 = reinterpret_cast<sockaddr_in6*>(&peer);
+    if (::inet_pton(AF_INET, ip.c_str(), &v4->sin_addr) == 1) {
+        v4->sin_family = AF_INET;
+        v4->sin_port = htons(port);
+        length = sizeof(sockaddr_in);
+        return peer;
+    }
+    if (::inet_pton(AF_INET6, ip.c_str(), &v6->sin6_addr) == 1) {
+        v6->sin6_family = AF_INET6;
+        v6->sin6_port = htons(port);
+        length = sizeof(sockaddr_in6);
+        return peer;
+    }
+    addrinfo hints{};
+    hints.ai_family = AF_INET;
+    hints.ai_socktype = SOCK_DGRAM;
+    addrinfo* found = nullptr;
+    const int status = ::getaddrinfo(ip.c_str(), std::to_string(port).c_str(), &hints, &found);
+    if (status != 0 || found == nullptr) {
+        error = status != 0 ? ::gai_strerror(status) : "Host not found";
+        if (found != nullptr) ::freeaddrinfo(found);
+        return peer;
+    }
+    std::memcpy(&peer, found->ai_addr, found->ai_addrlen);
+    length = found->ai_addrlen;
+    ::freeaddrinfo(found);
+    return peer;
 }
 
+}  // namespace
+
+UdpSocketBase::~UdpSocketBase() { close(); }
+
 bool UdpSocketBase::initial(std::uint16_t port, const std::string& ip, int /*timeout*/) {
-    initClientSocket();
     std::lock_guard<std::mutex> lock(mutex_);
-    asio::error_code ec;
-    asio::ip::udp::endpoint endpoint;
-    const asio::ip::address address = asio::ip::make_address(ip, ec);
-    if (!ec) {
-        endpoint = asio::ip::udp::endpoint(address, port);
-    } else {
-        asio::ip::udp::resolver resolver(io_);
-        const auto results = resolver.resolve(asio::ip::udp::v4(), ip, std::to_string(port), ec);
-        if (!ec && results.empty()) ec = asio::error::host_not_found;
-        if (!ec) endpoint = *results.begin();
+    used_ = true;
+    if (fd_ >= 0) {
+        ::close(fd_);
+        fd_ = -1;
     }
-    if (!ec && socket->is_open()) socket->close(ec);
-    if (!ec) socket->open(endpoint.protocol(), ec);
-    if (!ec) socket->non_blocking(true, ec);
-    if (!ec) socket->connect(endpoint, ec);
-    if (ec) {
-        Utils::mPrintlog("[UdpSocketBase::udpSocket] Error connecting to host: " + ec.message());
-        asio::error_code ignored;
-        socket->close(ignored);
+    std::string error;
+    socklen_t length = 0;
+    const sockaddr_storage peer = peerOf(ip, port, length, error);
+    if (error.empty()) {
+        fd_ = ::socket(peer.ss_family, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+        if (fd_ < 0 || ::connect(fd_, reinterpret_cast<const sockaddr*>(&peer), length) != 0) error = systemMessage(errno);
+    }
+    if (!error.empty()) {
+        Utils::mPrintlog("[UdpSocketBase::udpSocket] Error connecting to host: " + error);
+        if (fd_ >= 0) ::close(fd_);
+        fd_ = -1;
         return false;
     }
     return true;
@@ -42,21 +81,18 @@ bool UdpSocketBase::initial(std::uint16_t port, const std::string& ip, int /*tim
 
 bool UdpSocketBase::close() {
     std::lock_guard<std::mutex> lock(mutex_);
-    if (socket && socket->is_open()) {
-        asio::error_code ignored;
-        socket->close(ignored);
-    }
+    if (fd_ >= 0) ::close(fd_);
+    fd_ = -1;
     return true;
 }
 
 bool UdpSocketBase::sendMsg(double /*time*/, const Bytes& data) {
     std::lock_guard<std::mutex> lock(mutex_);
-    if (!socket) return false;
-    asio::error_code ec;
-    if (!socket->is_open()) ec = asio::error::not_connected;
-    if (!ec) socket->send(asio::buffer(data), 0, ec);
-    if (ec) {
-        const std::string reason = ec.message();
+    if (!used_) return false;
+    int error = fd_ < 0 ? ENOTCONN : 0;
+    if (error == 0 && ::send(fd_, data.data(), data.size(), MSG_DONTWAIT | MSG_NOSIGNAL) < 0) error = errno;
+    if (error != 0) {
+        const std::string reason = systemMessage(error);
         Utils::mPrintlog("[UdpSocketBase::udpSocket] Failed to send message: " +
                          (reason.empty() ? std::string("Unknown error") : reason));
         return false;

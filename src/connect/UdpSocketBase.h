@@ -1,12 +1,11 @@
 // A connected UDP client socket that sends single datagrams to a local peer (the telemetry
-// collector, the push client): the datagram variant of ISocketBase.
+// collector, the push client): the datagram variant of ISocketBase. A plain socket: no event
+// loop and no thread behind it, so that a datagram costs one system call; sends, connects and
+// closes may come from any thread.
 #pragma once
 
-#include <asio/io_context.hpp>
-#include <asio/ip/udp.hpp>
 #include <cstdint>
 #include <mutex>
-#include <optional>
 #include <string>
 
 #include "connect/ISocketBase.h"
@@ -32,13 +31,10 @@ public:
     bool isSocketNull() override;
     std::string getSokcetType() override;  // "udp"
 
-    // Creates the (not yet opened) socket; initial() calls it when needed.
-    virtual void initClientSocket();
-
-protected:
-    std::mutex mutex_;  // guards `socket`
-    asio::io_context io_;
-    std::optional<asio::ip::udp::socket> socket;
+private:
+    std::mutex mutex_;     // guards the two below
+    int fd_ = -1;
+    bool used_ = false;    // initial() was called at least once
 };
 
 }  // namespace kesu

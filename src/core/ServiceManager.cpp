@@ -23,7 +23,7 @@ void ServiceManager::start() {
     Utils::mPrintlog("[Server Start]this is ServiceManager \n");
 
     // LAN discovery (adapter check and announcement loop), then the pre-connection scheduler.
-    serviceWorker_ = std::make_unique<ServiceWorker>();
+    serviceWorker_ = std::make_unique<ServiceWorker>(loop_);
     serviceWorker_->start();
 
     // The server for phone-initiated connections.

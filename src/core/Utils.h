@@ -108,8 +108,6 @@ public:
     static void setPrimaryConnectDeviceType(const std::string& type);
     static bool getWlanConnState();
     static void setWlanConnState(bool state);
-    static double getSsdpDetectedLastTime();
-    static void setSsdpDetectedLastTime(double time);
 
     static std::string connectCenterServerUrl();
     static void setConnectCenterServerUrl(const std::string& url);

@@ -40,7 +40,6 @@ std::atomic<bool> isAutoConnFlag{false};
 std::atomic<bool> isCanConnectDevice{true};
 std::atomic<bool> isCanPrimaryConnectDevice{true};
 std::atomic<bool> wlanConnState{false};
-std::atomic<double> ssdpDetectedLastTime{0.0};
 
 // The texts, under one lock.
 struct TextState {
@@ -412,8 +411,6 @@ void Utils::setPrimaryConnectDeviceType(const std::string& type) {
 }
 bool Utils::getWlanConnState() { return wlanConnState.load(); }
 void Utils::setWlanConnState(bool state) { wlanConnState.store(state); }
-double Utils::getSsdpDetectedLastTime() { return ssdpDetectedLastTime.load(); }
-void Utils::setSsdpDetectedLastTime(double time) { ssdpDetectedLastTime.store(time); }
 
 std::string Utils::connectCenterServerUrl() {
     const std::string url = readText(&TextState::connectCenterOverride);
@@ -449,7 +446,6 @@ void Utils::resetStateForTest() {
     isCanConnectDevice.store(true);
     isCanPrimaryConnectDevice.store(true);
     wlanConnState.store(false);
-    ssdpDetectedLastTime.store(0.0);
     TextState& s = texts();
     std::lock_guard<std::mutex> guard(s.lock);
     s.connectingDeviceType.clear();

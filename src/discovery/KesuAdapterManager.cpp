@@ -1,11 +1,14 @@
 #include "discovery/KesuAdapterManager.h"
 
+#include <asio/steady_timer.hpp>
 #include <chrono>
 
 #include "account/DataInstance.h"
 #include "core/Config.h"
+#include "core/EventLoop.h"
 #include "core/Json.h"
 #include "core/Utils.h"
+#include "discovery/SsdpDeviceManager.h"
 #include "discovery/SsdpMessage.h"
 #include "events/EventPublisher.h"
 
@@ -22,35 +25,92 @@ std::string interfaceOf(const std::string& kind, const std::string& wifiName, co
     return kind == kWifi ? wifiName : ethernetName;
 }
 
+SsdpSocket::Receiver classifyInto(SsdpDeviceManager& devices, SsdpSocket::Receiver receiver) {
+    if (receiver) return receiver;
+    return [&devices](std::string_view data, const std::string& host, std::uint16_t) {
+        SsdpMessage::handleDatagram(data, host, devices);
+    };
+}
+
 }  // namespace
 
-KesuAdapterManager& KesuAdapterManager::instance() {
-    static KesuAdapterManager* manager = new KesuAdapterManager();
-    return *manager;
+// A socket waiting out the rebuild pause before it opens again.
+struct KesuAdapterManager::Rebuild {
+    explicit Rebuild(asio::io_context& io) : timer(io) {}
+    asio::steady_timer timer;
+};
+
+KesuAdapterManager::KesuAdapterManager(EventLoop& loop) : KesuAdapterManager(loop, SsdpDeviceManager::instance()) {}
+
+KesuAdapterManager::KesuAdapterManager(EventLoop& loop, SsdpDeviceManager& devices, SsdpSocket::Receiver receiver)
+    : loop_(loop), devices_(devices), receiver_(classifyInto(devices, std::move(receiver))) {
+    // Nothing on the loop knows the monitor yet: the first sockets open here, on the
+    // constructing thread.
+    createSockets();
 }
 
-KesuAdapterManager::KesuAdapterManager(SsdpSocket::Receiver receiver) : receiver_(std::move(receiver)) {
-    creatAdapterSocket();
+KesuAdapterManager::~KesuAdapterManager() {
+    loop_.call([this] {
+        shutdownNow();
+        alive_.reset();
+    });
 }
-
-KesuAdapterManager::~KesuAdapterManager() { shutdown(); }
 
 void KesuAdapterManager::creatAdapterSocket() {
-    std::lock_guard<std::mutex> check(checkMutex_);
-    creatAdapterSocketLocked();
+    loop_.call([this] { createSockets(); });
 }
 
-void KesuAdapterManager::creatAdapterSocketLocked() {
+void KesuAdapterManager::checkNetWorkStatus() {
+    loop_.call([this] { check(); });
+}
+
+void KesuAdapterManager::sendSsdp() {
+    loop_.call([this] { announce(); });
+}
+
+void KesuAdapterManager::shutdown() {
+    loop_.call([this] { shutdownNow(); });
+}
+
+bool KesuAdapterManager::isActive() {
+    return loop_.call([this] { return active_; }).value_or(false);
+}
+
+std::vector<std::string> KesuAdapterManager::socketInterfaces() {
+    return loop_
+        .call([this] {
+            std::vector<std::string> names;
+            for (const auto& entry : ssdpManager) names.push_back(entry.first);
+            return names;
+        })
+        .value_or(std::vector<std::string>());
+}
+
+std::shared_ptr<SsdpSocketManager> KesuAdapterManager::managerFor(const std::string& interfaceName) {
+    return loop_
+        .call([this, &interfaceName] {
+            const auto it = ssdpManager.find(interfaceName);
+            return it == ssdpManager.end() ? nullptr : it->second;
+        })
+        .value_or(nullptr);
+}
+
+std::map<std::string, std::string> KesuAdapterManager::networkStatus() {
+    return loop_.call([this] { return netStatus; }).value_or(std::map<std::string, std::string>());
+}
+
+bool KesuAdapterManager::isWiFiEnabled() { return Utils::SsidWifiCondition(); }
+
+// ---- On the loop ---------------------------------------------------------------------------
+
+void KesuAdapterManager::createSockets() {
     const std::map<std::string, std::string> snapshot = Utils::getNetworkCorrespondAddress();
     const std::string wifiName = Utils::GetWifiName();
     const std::string ethernetName = Utils::GetEthernetName();
-    {
-        std::lock_guard<std::mutex> guard(lock_);
-        netStatus = snapshot;
-        active_ = true;
-    }
+    netStatus = snapshot;
+    active_ = true;
     // The first "blocked socket" check comes a whole time-out after the start.
-    Utils::setSsdpDetectedLastTime(Utils::currentTimeStamp());
+    devices_.markOwnEcho();
     Utils::mPrintlog(" [netcard status] Currently network card status:" + json::pretty(Json(snapshot)));
     for (const auto& [kind, address] : snapshot) {
         if (kind != kWifi && kind != kEthernet) continue;
@@ -58,29 +118,21 @@ void KesuAdapterManager::creatAdapterSocketLocked() {
     }
 }
 
-bool KesuAdapterManager::isWiFiEnabled() { return Utils::SsidWifiCondition(); }
-
-void KesuAdapterManager::checkNetWorkStatus() {
-    std::lock_guard<std::mutex> check(checkMutex_);
-
+void KesuAdapterManager::check() {
     // 1. Wi-Fi power.
     const bool wifiOn = isWiFiEnabled();
-    bool wifiChanged = false;
-    {
-        std::lock_guard<std::mutex> guard(lock_);
-        if (wifiOn != wifiSwitch) {
-            wifiSwitch = !wifiSwitch;
-            wifiChanged = true;
-        }
+    if (wifiOn != wifiSwitch) {
+        wifiSwitch = !wifiSwitch;
+        publish(wifiOn ? "WifiOpenEvent" : "WifiCloseEvent");
     }
-    if (wifiChanged) publish(wifiOn ? "WifiOpenEvent" : "WifiCloseEvent");
 
     // 2. The current snapshot and the interface names of this moment.
     const std::map<std::string, std::string> current = Utils::getNetworkCorrespondAddress();
     const std::string wifiName = Utils::GetWifiName();
     const std::string ethernetName = Utils::GetEthernetName();
-    const std::map<std::string, std::string> previous = networkStatus();
-    const double selfEchoTimeout = std::chrono::duration<double>(Config::current().ssdpSelfEchoTimeout).count();
+    const std::map<std::string, std::string> previous = netStatus;
+    const bool echoTimedOut =
+        devices_.clock().now() - devices_.lastOwnEcho() > Config::current().ssdpSelfEchoTimeout;
     bool timedOut = false;
 
     // 3. Adapters added, readdressed, or silent.
@@ -103,7 +155,7 @@ void KesuAdapterManager::checkNetWorkStatus() {
         if (known->second == address) {
             // The time stamp is refreshed by any socket that hears the PC's own announcement,
             // so one adapter that still hears it keeps every socket as it is.
-            if (Utils::currentTimeStamp() - Utils::getSsdpDetectedLastTime() > selfEchoTimeout) {
+            if (echoTimedOut) {
                 timedOut = true;
                 statusLine(current);
                 Utils::mPrintlog(
@@ -113,14 +165,11 @@ void KesuAdapterManager::checkNetWorkStatus() {
             } else {
                 // The adapter of this kind now has another interface name (with the same
                 // address): its socket must follow it, or it would stay on the old one.
-                std::string socketName;
-                {
-                    std::lock_guard<std::mutex> guard(lock_);
-                    if (auto it = socketInterface_.find(kind); it != socketInterface_.end()) socketName = it->second;
-                }
-                if (!socketName.empty() && socketName != name) {
-                    Utils::mPrintlog("[checkNetWorkStatus] adapter " + kind + " moved from " + socketName + " to " +
-                                     name + " \n");
+                const auto socketName = socketInterface_.find(kind);
+                if (socketName != socketInterface_.end() && !socketName->second.empty() &&
+                    socketName->second != name) {
+                    Utils::mPrintlog("[checkNetWorkStatus] adapter " + kind + " moved from " + socketName->second +
+                                     " to " + name + " \n");
                     rebuildSocket(kind, name);
                 }
             }
@@ -145,7 +194,7 @@ void KesuAdapterManager::checkNetWorkStatus() {
     }
 
     // 4. A still-silent network rebuilds at most once per time-out, not on every check.
-    if (timedOut) Utils::setSsdpDetectedLastTime(Utils::currentTimeStamp());
+    if (timedOut) devices_.markOwnEcho();
 
     // 5. Adapters removed.
     for (const auto& [kind, address] : previous) {
@@ -165,123 +214,100 @@ void KesuAdapterManager::checkNetWorkStatus() {
     }
 
     // 6.
-    std::lock_guard<std::mutex> guard(lock_);
     netStatus = current;
 }
 
-void KesuAdapterManager::sendSsdp() {
-    std::lock_guard<std::mutex> check(checkMutex_);
+void KesuAdapterManager::announce() {
     const std::string deviceName = Utils::getLocalName();
     const std::string deviceId = Utils::getMacAddress();
     const std::string openId = dataInstance().get(&databaseParam::openid);
     const std::string account = dataInstance().get(&databaseParam::Phone);
     const std::string serviceId = SsdpMessage::pcServiceRecord();
-    std::vector<std::shared_ptr<SsdpSocketManager>> managers;
-    {
-        std::lock_guard<std::mutex> guard(lock_);
-        for (const auto& entry : ssdpManager) managers.push_back(entry.second);
-    }
-    for (const auto& manager : managers) manager->sendResponseData(deviceName, deviceId, account, openId, serviceId);
+    for (const auto& entry : ssdpManager) entry.second->sendResponseData(deviceName, deviceId, account, openId, serviceId);
 }
 
-void KesuAdapterManager::shutdown() {
-    std::lock_guard<std::mutex> check(checkMutex_);
-    std::map<std::string, std::shared_ptr<SsdpSocketManager>> managers;
-    {
-        std::lock_guard<std::mutex> guard(lock_);
-        managers.swap(ssdpManager);
-        netStatus.clear();
-        socketInterface_.clear();
-        wifiSwitch = false;
-        active_ = false;
-    }
+void KesuAdapterManager::announceOn(SsdpSocketManager& manager) {
+    manager.sendResponseData(Utils::getLocalName(), Utils::getMacAddress(), dataInstance().get(&databaseParam::Phone),
+                             dataInstance().get(&databaseParam::openid), SsdpMessage::pcServiceRecord());
+}
+
+void KesuAdapterManager::shutdownNow() {
+    for (const auto& entry : rebuilds_) entry.second->timer.cancel();
+    rebuilds_.clear();
+    const auto managers = std::exchange(ssdpManager, {});
+    netStatus.clear();
+    socketInterface_.clear();
+    wifiSwitch = false;
+    active_ = false;
     for (const auto& entry : managers) entry.second->deleteSocket();
 }
 
-bool KesuAdapterManager::isActive() const {
-    std::lock_guard<std::mutex> guard(lock_);
-    return active_;
-}
-
-void KesuAdapterManager::interruptPauses() {
-    std::lock_guard<std::mutex> guard(pauseMutex_);
-    pauseInterrupted_ = true;
-    pauseCv_.notify_all();
-}
-
-void KesuAdapterManager::resumePauses() {
-    std::lock_guard<std::mutex> guard(pauseMutex_);
-    pauseInterrupted_ = false;
-}
-
-std::vector<std::string> KesuAdapterManager::socketInterfaces() const {
-    std::lock_guard<std::mutex> guard(lock_);
-    std::vector<std::string> names;
-    for (const auto& entry : ssdpManager) names.push_back(entry.first);
-    return names;
-}
-
-std::shared_ptr<SsdpSocketManager> KesuAdapterManager::managerFor(const std::string& interfaceName) const {
-    std::lock_guard<std::mutex> guard(lock_);
-    const auto it = ssdpManager.find(interfaceName);
-    return it == ssdpManager.end() ? nullptr : it->second;
-}
-
-std::map<std::string, std::string> KesuAdapterManager::networkStatus() const {
-    std::lock_guard<std::mutex> guard(lock_);
-    return netStatus;
-}
-
-// ---- Helpers -------------------------------------------------------------------------------
-
 void KesuAdapterManager::addSocket(const std::string& kind, const std::string& interfaceName) {
-    auto manager = std::make_shared<SsdpSocketManager>(receiver_);
+    auto manager = std::make_shared<SsdpSocketManager>(loop_, receiver_);
     manager->createSocket(interfaceName);
-    std::shared_ptr<SsdpSocketManager> replaced;
-    {
-        std::lock_guard<std::mutex> guard(lock_);
-        replaced = std::exchange(ssdpManager[interfaceName], manager);
-        socketInterface_[kind] = interfaceName;
-    }
+    const std::shared_ptr<SsdpSocketManager> replaced = std::exchange(ssdpManager[interfaceName], manager);
+    socketInterface_[kind] = interfaceName;
     if (replaced) replaced->deleteSocket();
 }
 
 void KesuAdapterManager::rebuildSocket(const std::string& kind, const std::string& interfaceName) {
-    std::string oldName;
-    {
-        std::lock_guard<std::mutex> guard(lock_);
-        if (auto it = socketInterface_.find(kind); it != socketInterface_.end()) oldName = it->second;
+    cancelRebuild(kind);
+    if (auto it = socketInterface_.find(kind); it != socketInterface_.end() && it->second != interfaceName) {
+        dropManager(it->second);
     }
-    if (!oldName.empty() && oldName != interfaceName) dropManager(oldName);
-    if (auto manager = managerFor(interfaceName)) manager->deleteSocket();
-    pause();
+    if (auto it = ssdpManager.find(interfaceName); it != ssdpManager.end()) it->second->deleteSocket();
+    // From now on this kind's socket belongs on `interfaceName`, also during the pause.
+    socketInterface_[kind] = interfaceName;
+
+    const auto pause = Config::current().ssdpRebuildPause;
+    if (pause <= std::chrono::milliseconds::zero()) {
+        reopen(kind, interfaceName);
+        return;
+    }
+    auto rebuild = std::make_shared<Rebuild>(loop_.context());
+    rebuilds_[kind] = rebuild;
+    rebuild->timer.expires_after(pause);
+    rebuild->timer.async_wait([this, alive = std::weak_ptr<int>(alive_), rebuild, kind,
+                               interfaceName](const asio::error_code& error) {
+        if (error || alive.expired()) return;
+        const auto it = rebuilds_.find(kind);
+        if (it == rebuilds_.end() || it->second != rebuild) return;  // superseded or dropped
+        rebuilds_.erase(it);
+        reopen(kind, interfaceName);
+        // The pass that asked for the rebuild announced without this socket.
+        if (auto manager = ssdpManager.find(interfaceName); manager != ssdpManager.end()) announceOn(*manager->second);
+    });
+}
+
+void KesuAdapterManager::reopen(const std::string& kind, const std::string& interfaceName) {
     addSocket(kind, interfaceName);
     logInterface(kind, interfaceName);
 }
 
+void KesuAdapterManager::cancelRebuild(const std::string& kind) {
+    if (auto it = rebuilds_.find(kind); it != rebuilds_.end()) {
+        it->second->timer.cancel();
+        rebuilds_.erase(it);
+    }
+}
+
 std::string KesuAdapterManager::removeSocket(const std::string& kind, const std::string& fallbackName) {
+    cancelRebuild(kind);
     std::string name = fallbackName;
-    {
-        std::lock_guard<std::mutex> guard(lock_);
-        if (auto it = socketInterface_.find(kind); it != socketInterface_.end()) {
-            name = it->second;
-            socketInterface_.erase(it);
-        }
+    if (auto it = socketInterface_.find(kind); it != socketInterface_.end()) {
+        name = it->second;
+        socketInterface_.erase(it);
     }
     dropManager(name);
     return name;
 }
 
 void KesuAdapterManager::dropManager(const std::string& interfaceName) {
-    std::shared_ptr<SsdpSocketManager> manager;
-    {
-        std::lock_guard<std::mutex> guard(lock_);
-        if (auto it = ssdpManager.find(interfaceName); it != ssdpManager.end()) {
-            manager = std::move(it->second);
-            ssdpManager.erase(it);
-        }
+    if (auto it = ssdpManager.find(interfaceName); it != ssdpManager.end()) {
+        const std::shared_ptr<SsdpSocketManager> manager = std::move(it->second);
+        ssdpManager.erase(it);
+        manager->deleteSocket();
     }
-    if (manager) manager->deleteSocket();
 }
 
 void KesuAdapterManager::logInterface(const std::string& kind, const std::string& interfaceName) {
@@ -294,11 +320,6 @@ void KesuAdapterManager::logInterface(const std::string& kind, const std::string
 
 void KesuAdapterManager::statusLine(const std::map<std::string, std::string>& snapshot) {
     Utils::mPrintlog("[checkNetWorkStatus] Currently netcard status: " + json::compact(Json(snapshot)));
-}
-
-void KesuAdapterManager::pause() {
-    std::unique_lock<std::mutex> guard(pauseMutex_);
-    pauseCv_.wait_for(guard, Config::current().ssdpRebuildPause, [this] { return pauseInterrupted_; });
 }
 
 }  // namespace kesu

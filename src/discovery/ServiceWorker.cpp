@@ -4,17 +4,24 @@
 #include <string>
 
 #include "core/Config.h"
+#include "core/EventLoop.h"
+#include "core/PeriodicTimer.h"
 #include "core/Utils.h"
 #include "discovery/KesuAdapterManager.h"
+#include "discovery/LinkChangeListener.h"
 #include "discovery/SsdpDeviceManager.h"
 
 namespace kesu {
+
+ServiceWorker::ServiceWorker(EventLoop& loop) : ServiceWorker(loop, SsdpDeviceManager::instance()) {}
+
+ServiceWorker::ServiceWorker(EventLoop& loop, SsdpDeviceManager& devices) : loop_(loop), devices_(devices) {}
 
 ServiceWorker::~ServiceWorker() { stop(); }
 
 void ServiceWorker::start() {
     std::lock_guard<std::mutex> lifecycle(lifecycle_);
-    if (isRunning()) return;
+    if (running_.load()) return;
     ssdpInitLocked();
     preconnectInit();
 }
@@ -25,55 +32,41 @@ void ServiceWorker::ssdpInit() {
 }
 
 void ServiceWorker::ssdpInitLocked() {
-    if (isRunning()) return;
-    SsdpDeviceManager::instance();
-    KesuAdapterManager& adapters = KesuAdapterManager::instance();
-    if (!adapters.isActive()) adapters.creatAdapterSocket();  // again after a stop
-    adapters.resumePauses();
-    std::lock_guard<std::mutex> guard(mutex_);
-    stopping_ = false;
-    ssdpThread_ = std::thread([this] { ssdpLoop(); });
+    if (running_.load()) return;
+    adapters_ = std::make_unique<KesuAdapterManager>(loop_, devices_);
+    passes_ = std::make_unique<PeriodicTimer>(
+        loop_.context(), [] { return Config::current().ssdpAnnouncePeriod; }, [this] { pass(); });
+    // A burst of kernel notifications is one extra pass, which also restarts the period.
+    changes_ = std::make_unique<LinkChangeListener>(loop_, [this] { passes_->runNow(); });
+    running_.store(true);
+    passes_->start(std::chrono::milliseconds(0));
 }
 
 void ServiceWorker::preconnectInit() {
-    // The pre-connection scheduler (its own thread, one pass per second) is started here,
+    // The pre-connection scheduler (on the loop, one pass per second) is started here,
     // after discovery, and stopped in stop().
 }
 
 void ServiceWorker::stop() {
     std::lock_guard<std::mutex> lifecycle(lifecycle_);
-    std::thread loop;
-    {
-        std::lock_guard<std::mutex> guard(mutex_);
-        if (!ssdpThread_.joinable()) return;
-        stopping_ = true;
-        loop = std::move(ssdpThread_);
-    }
-    wake_.notify_all();
-    KesuAdapterManager::instance().interruptPauses();
-    loop.join();
-    KesuAdapterManager::instance().shutdown();
+    if (!running_.exchange(false)) return;
+    changes_->stop();
+    passes_->stop();
+    // After this no pass runs any more: one that was running has ended, later ones see the
+    // timer stopped.
+    loop_.call([] {});
+    changes_.reset();
+    passes_.reset();
+    adapters_.reset();  // closes the sockets and drops pending rebuilds, on the loop
 }
 
-bool ServiceWorker::isRunning() const {
-    std::lock_guard<std::mutex> guard(mutex_);
-    return ssdpThread_.joinable();
-}
-
-void ServiceWorker::ssdpLoop() {
-    KesuAdapterManager& adapters = KesuAdapterManager::instance();
-    std::unique_lock<std::mutex> guard(mutex_);
-    while (!stopping_) {
-        guard.unlock();
-        try {
-            adapters.checkNetWorkStatus();
-            adapters.sendSsdp();
-        } catch (const std::exception& e) {
-            // The loop is the whole of discovery: one failed pass must not end it.
-            Utils::mPrintlog(std::string("[ServiceWorker::ssdpInit] pass failed: ") + e.what());
-        }
-        guard.lock();
-        wake_.wait_for(guard, Config::current().ssdpAnnouncePeriod, [this] { return stopping_; });
+void ServiceWorker::pass() {
+    try {
+        adapters_->checkNetWorkStatus();
+        adapters_->sendSsdp();
+    } catch (const std::exception& e) {
+        // One failed pass must not end discovery.
+        Utils::mPrintlog(std::string("[ServiceWorker::ssdpInit] pass failed: ") + e.what());
     }
 }
 

@@ -21,7 +21,8 @@ public:
     bool isOpenIdSame = false;         // same open id as the account signed in on this PC
     bool isDeviceNameFull = true;      // false when deviceName was masked
     bool isAccountFull = true;         // false when account was masked
-    double lastUpdate = 0.0;           // seconds, time of the datagram that stored it
+    double lastUpdate = 0.0;           // wall-clock seconds of the datagram that stored it (shown
+                                       // and logged only: the table ages entries monotonically)
     std::string deviceType = "phone";  // "phone" or "pad"
 
     // The ten members of the device-list element; lastUpdate is not part of it.

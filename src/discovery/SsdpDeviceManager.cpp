@@ -9,12 +9,12 @@ SsdpDeviceManager& SsdpDeviceManager::instance() {
     return *manager;
 }
 
-SsdpDeviceManager::SsdpDeviceManager(std::size_t maxDevices, double expirySeconds)
-    : ssdpDeviceMap(maxDevices, expirySeconds) {}
+SsdpDeviceManager::SsdpDeviceManager(std::size_t maxDevices, double expirySeconds, const SteadyClock& clock)
+    : ssdpDeviceMap(maxDevices, expirySeconds, clock), clock_(clock) {}
 
 std::vector<SsdpDevicePtr> SsdpDeviceManager::getAllDevices() const { return ssdpDeviceMap.getDevicesArray(); }
 
-bool SsdpDeviceManager::deleteDevices() { return ssdpDeviceMap.eraseTimeOut(Utils::currentTimeStamp()); }
+bool SsdpDeviceManager::deleteDevices() { return ssdpDeviceMap.eraseTimeOut(); }
 
 bool SsdpDeviceManager::getQueryAll(std::string& res) {
     deleteDevices();

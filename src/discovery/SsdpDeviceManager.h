@@ -1,7 +1,10 @@
-// The process-wide holder of the discovered-device table, its queries, and the hook through
-// which the device-list reporting learns of an announcement before it is stored.
+// The process-wide holder of the discovered-device table, its queries, the hook through
+// which the device-list reporting learns of an announcement before it is stored, and the
+// time the PC last heard its own announcement (which tells the adapter monitor that its
+// sockets still hear the group).
 #pragma once
 
+#include <atomic>
 #include <cstddef>
 #include <functional>
 #include <mutex>
@@ -9,6 +12,7 @@
 #include <utility>
 #include <vector>
 
+#include "core/SteadyClock.h"
 #include "discovery/SsdpDevice.h"
 #include "discovery/SsdpSafemap.h"
 
@@ -24,12 +28,13 @@ public:
     static SsdpDeviceManager& instance();
 
     SsdpDeviceManager() = default;
-    SsdpDeviceManager(std::size_t maxDevices, double expirySeconds);
+    // `clock` (which must outlive the manager) measures the expiry and the own echo.
+    SsdpDeviceManager(std::size_t maxDevices, double expirySeconds, const SteadyClock& clock = SteadyClock::system());
 
     SsdpSafemap ssdpDeviceMap;
 
     std::vector<SsdpDevicePtr> getAllDevices() const;
-    // Expiry sweep at the current time; true when something was removed.
+    // Expiry sweep now; true when something was removed.
     bool deleteDevices();
     // Sweeps, then writes {"error":0,"error_message":"","data":[device...]} pretty-printed
     // into `res`. Always true.
@@ -41,7 +46,19 @@ public:
     // Runs every registered observer on `device` (in registration order).
     void notifyChange(const SsdpDevice& device) const;
 
+    // The PC heard its own announcement now (the adapter monitor also marks the start of its
+    // wait for the first one). Any thread.
+    void markOwnEcho() { ownEcho_.store(clock_.now().time_since_epoch().count()); }
+    // When markOwnEcho last ran (the clock's zero before it ever did).
+    SteadyClock::time_point lastOwnEcho() const {
+        return SteadyClock::time_point(SteadyClock::duration(ownEcho_.load()));
+    }
+    const SteadyClock& clock() const { return clock_; }
+
 private:
+    const SteadyClock& clock_ = SteadyClock::system();
+    std::atomic<SteadyClock::duration::rep> ownEcho_{0};
+
     mutable std::mutex observerLock_;
     std::vector<std::pair<std::size_t, ChangeObserver>> observers_;
     std::size_t nextToken_ = 1;

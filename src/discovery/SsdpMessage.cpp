@@ -112,7 +112,7 @@ SsdpMessage::Handling SsdpMessage::handleDatagram(std::string_view data, const s
     // sockets still hear the group. An empty name would match everything: it matches nothing.
     const std::string localName = Utils::getLocalName();
     if (!localName.empty() && contains(decoded, localName)) {
-        Utils::setSsdpDetectedLastTime(Utils::currentTimeStamp());
+        manager.markOwnEcho();
     }
     if ((contains(decoded, "\"deviceType\":\"mobile\"") || contains(decoded, "\"deviceType\":\"pad\"")) &&
         contains(decoded, pcsuiteServiceId())) {

@@ -38,8 +38,8 @@ public:
         currentFormat,  // handed to insertResponseDevice as current format
     };
 
-    // The whole receive path for one datagram from `host`: classification, the own-name time
-    // stamp, parse and store into `manager`'s table.
+    // The whole receive path for one datagram from `host`: classification, the own echo
+    // noted in `manager`, parse and store into its table.
     static Handling handleDatagram(std::string_view data, const std::string& host);
     static Handling handleDatagram(std::string_view data, const std::string& host, SsdpDeviceManager& manager);
 

@@ -1,39 +1,36 @@
 #include "discovery/SsdpSafemap.h"
 
+#include <chrono>
+
 #include "core/Config.h"
 #include "core/Utils.h"
 
-#include <cmath>
-
 namespace kesu {
-
-namespace {
-// The age used for ordering: a time stamp that is not a finite number counts as never set,
-// so the ordering of the age index stays sound whatever a caller stored.
-double ageOf(const SsdpDevicePtr& device) { return std::isfinite(device->lastUpdate) ? device->lastUpdate : 0.0; }
-}  // namespace
 
 SsdpSafemap::SsdpSafemap()
     : SsdpSafemap(Config::current().ssdpMaxDevices,
                   std::chrono::duration<double>(Config::current().ssdpDeviceExpiry).count()) {}
 
-SsdpSafemap::SsdpSafemap(std::size_t maxDevices, double expirySeconds)
-    : maxDevices_(maxDevices == 0 ? 1 : maxDevices), expirySeconds_(expirySeconds) {}
+SsdpSafemap::SsdpSafemap(std::size_t maxDevices, double expirySeconds, const SteadyClock& clock)
+    : maxDevices_(maxDevices == 0 ? 1 : maxDevices),
+      expiry_(std::chrono::duration_cast<SteadyClock::duration>(std::chrono::duration<double>(expirySeconds))),
+      clock_(clock) {}
 
-void SsdpSafemap::eraseLocked(std::map<std::string, SsdpDevicePtr>::iterator it) {
-    byAge_.erase({ageOf(it->second), it->first});
+void SsdpSafemap::eraseLocked(Entries::iterator it) {
+    byAge_.erase({it->second.heard, it->first});
     safeMap.erase(it);
 }
 
 void SsdpSafemap::storeLocked(const std::string& key, SsdpDevicePtr value) {
+    const SteadyClock::time_point now = clock_.now();
     auto it = safeMap.find(key);
     if (it != safeMap.end()) {
-        byAge_.erase({ageOf(it->second), key});
-        it->second = std::move(value);
+        byAge_.erase({it->second.heard, key});
+        it->second = Entry{std::move(value), now};
     } else {
-        it = safeMap.emplace(key, std::move(value)).first;
+        it = safeMap.emplace(key, Entry{std::move(value), now}).first;
     }
-    byAge_.emplace(ageOf(it->second), key);
+    byAge_.emplace(now, key);
 }
 
 bool SsdpSafemap::insert(const std::string& opKey, SsdpDevicePtr opValue, bool cover) {
@@ -72,7 +69,7 @@ bool SsdpSafemap::lookup(const std::string& opKey, SsdpDevicePtr& opValue) const
     std::lock_guard<std::mutex> guard(lock);
     auto it = safeMap.find(opKey);
     if (it == safeMap.end()) return false;
-    opValue = it->second;
+    opValue = it->second.device;
     return true;
 }
 
@@ -88,18 +85,19 @@ std::vector<SsdpDevicePtr> SsdpSafemap::getDevicesArray() const {
     std::lock_guard<std::mutex> guard(lock);
     std::vector<SsdpDevicePtr> devices;
     devices.reserve(safeMap.size());
-    for (const auto& entry : safeMap) devices.push_back(entry.second);
+    for (const auto& entry : safeMap) devices.push_back(entry.second.device);
     return devices;
 }
 
-bool SsdpSafemap::eraseTimeOut(double now) {
+bool SsdpSafemap::eraseTimeOut() {
     std::vector<SsdpDevicePtr> erased;
     {
         std::lock_guard<std::mutex> guard(lock);
+        const SteadyClock::time_point now = clock_.now();
         // Oldest first: stop at the first entry young enough to stay.
-        while (!byAge_.empty() && now - byAge_.begin()->first > expirySeconds_) {
+        while (!byAge_.empty() && now - byAge_.begin()->first > expiry_) {
             auto it = safeMap.find(byAge_.begin()->second);
-            erased.push_back(it->second);
+            erased.push_back(it->second.device);
             eraseLocked(it);
         }
         if (safeMap.size() < maxDevices_) evictionLogged_ = false;
@@ -108,6 +106,13 @@ bool SsdpSafemap::eraseTimeOut(double now) {
         Utils::mPrintlog("[eraseTimeOut]: erase ssdpdevice: " + device->deviceName + ", " + device->deviceId + "\r\n");
     }
     return !erased.empty();
+}
+
+void SsdpSafemap::clear() {
+    std::lock_guard<std::mutex> guard(lock);
+    safeMap.clear();
+    byAge_.clear();
+    evictionLogged_ = false;
 }
 
 std::size_t SsdpSafemap::size() const {

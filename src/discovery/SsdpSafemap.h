@@ -1,6 +1,8 @@
 // The lock-guarded table of discovered devices: device id -> latest record. Entries not
 // heard for longer than the expiry go at the next sweep. The table is bounded: when a new
-// id arrives at a full table, the entry heard longest ago makes room for it.
+// id arrives at a full table, the entry heard longest ago makes room for it. Ages are kept
+// on a monotonic clock, so a step of the wall clock neither expires live devices nor keeps
+// silent ones.
 #pragma once
 
 #include <cstddef>
@@ -11,6 +13,7 @@
 #include <utility>
 #include <vector>
 
+#include "core/SteadyClock.h"
 #include "discovery/SsdpDevice.h"
 
 namespace kesu {
@@ -19,21 +22,24 @@ class SsdpSafemap {
 public:
     // Bound and expiry from Config::current() (ssdpMaxDevices, ssdpDeviceExpiry).
     SsdpSafemap();
-    SsdpSafemap(std::size_t maxDevices, double expirySeconds);
+    // `clock` (which must outlive the table) stamps every store and drives the sweep.
+    SsdpSafemap(std::size_t maxDevices, double expirySeconds, const SteadyClock& clock = SteadyClock::system());
 
     // Stores the record under the key, replacing any present one (`cover` changes nothing
-    // visible). A new key in a full table evicts the entry with the oldest lastUpdate.
+    // visible), heard now. A new key in a full table evicts the entry heard longest ago.
     // Always true, except for a null record, which is not stored (false).
     bool insert(const std::string& opKey, SsdpDevicePtr opValue, bool cover = false);
     // True and the stored record in `opValue` when present; `opValue` untouched otherwise.
     bool lookup(const std::string& opKey, SsdpDevicePtr& opValue) const;
-    // Replaces a present record (true); stores nothing for an absent key (false).
+    // Replaces a present record, heard now (true); stores nothing for an absent key (false).
     bool update(const std::string& opKey, SsdpDevicePtr opValue);
     // All stored records, in no particular order.
     std::vector<SsdpDevicePtr> getDevicesArray() const;
-    // Removes every entry with now - lastUpdate > expiry (an entry exactly at the expiry
-    // stays); true when at least one went.
-    bool eraseTimeOut(double now);
+    // Removes every entry not heard for longer than the expiry (an entry exactly at the
+    // expiry stays); true when at least one went.
+    bool eraseTimeOut();
+    // Removes every entry.
+    void clear();
 
     std::size_t size() const;
     std::size_t maxDevices() const { return maxDevices_; }
@@ -41,16 +47,23 @@ public:
     std::size_t evictedCount() const;
 
 private:
+    struct Entry {
+        SsdpDevicePtr device;
+        SteadyClock::time_point heard;
+    };
+    using Entries = std::map<std::string, Entry>;
+
     void storeLocked(const std::string& key, SsdpDevicePtr value);
-    void eraseLocked(std::map<std::string, SsdpDevicePtr>::iterator it);
+    void eraseLocked(Entries::iterator it);
 
     const std::size_t maxDevices_;
-    const double expirySeconds_;
+    const SteadyClock::duration expiry_;
+    const SteadyClock& clock_;
 
     mutable std::mutex lock;
-    std::map<std::string, SsdpDevicePtr> safeMap;
-    // (lastUpdate, key) of every entry, oldest first: drives eviction and the sweep.
-    std::set<std::pair<double, std::string>> byAge_;
+    Entries safeMap;
+    // (heard, key) of every entry, oldest first: drives eviction and the sweep.
+    std::set<std::pair<SteadyClock::time_point, std::string>> byAge_;
     std::size_t evicted_ = 0;
     bool evictionLogged_ = false;  // one log line per stretch of time at the bound
 };

@@ -6,13 +6,14 @@
 
 namespace kesu {
 
-SsdpSocketManager::SsdpSocketManager(SsdpSocket::Receiver receiver) : receiver_(std::move(receiver)) {}
+SsdpSocketManager::SsdpSocketManager(EventLoop& loop, SsdpSocket::Receiver receiver)
+    : loop_(loop), receiver_(std::move(receiver)) {}
 
 SsdpSocketManager::~SsdpSocketManager() { deleteSocket(); }
 
-// The old socket is closed outside the lock: closing waits for its receive thread.
+// The old socket is closed outside the lock: closing off the loop waits for the loop.
 void SsdpSocketManager::createSocket(const std::string& inNetCard) {
-    auto fresh = std::make_shared<SsdpSocket>(inNetCard, receiver_);
+    auto fresh = std::make_shared<SsdpSocket>(loop_, inNetCard, receiver_);
     std::shared_ptr<SsdpSocket> old;
     {
         std::lock_guard<std::mutex> guard(lock_);

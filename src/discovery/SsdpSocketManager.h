@@ -10,11 +10,13 @@
 
 namespace kesu {
 
+class EventLoop;
+
 class SsdpSocketManager {
 public:
-    // Sockets made by this manager hand their datagrams to `receiver` (the discovery
-    // classification when empty).
-    explicit SsdpSocketManager(SsdpSocket::Receiver receiver = {});
+    // Sockets made by this manager live on `loop` and hand their datagrams to `receiver` (the
+    // discovery classification when empty).
+    explicit SsdpSocketManager(EventLoop& loop, SsdpSocket::Receiver receiver = {});
     ~SsdpSocketManager();
     SsdpSocketManager(const SsdpSocketManager&) = delete;
     SsdpSocketManager& operator=(const SsdpSocketManager&) = delete;
@@ -36,6 +38,7 @@ public:
 private:
     bool send(const std::string& message);
 
+    EventLoop& loop_;
     const SsdpSocket::Receiver receiver_;
     mutable std::mutex lock_;  // guards ssdpInstance
     std::shared_ptr<SsdpSocket> ssdpInstance;

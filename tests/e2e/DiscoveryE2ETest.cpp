@@ -77,7 +77,7 @@ TEST_F(DiscoveryE2E, PhoneAnnouncementsLandInTheDeviceTable) {
     ASSERT_TRUE(service->waitForOutput("Insert ssdp device, deviceId: 6162", 10s)) << service->output();
 
     auto answer = control(pc.ns, "SSDPQueryAll");
-    ASSERT_TRUE(answer.is_object()) << answer;
+    ASSERT_TRUE(answer.is_object()) << answer << "\n--- service:\n" << service->output();
     ASSERT_TRUE(answer.contains("data") && answer["data"].is_array()) << answer;
     const auto phoneRec = deviceIn(answer["data"].dump(), "53494d50");
     const auto padRec = deviceIn(answer["data"].dump(), "6162");
@@ -103,6 +103,9 @@ TEST_F(DiscoveryE2E, PcSuiteGetsTheListWhenAPhoneAppearsAndExpires) {
     auto pcsuite = startPcSuite();
     ASSERT_TRUE(pcsuite);
     auto service = startService();
+    // The phone announces once: the service's discovery socket must be listening by then
+    // (the control API comes up before discovery).
+    ASSERT_TRUE(service->waitForOutput("[SsdpSocket::initSocket] beginReceiving success", 10s)) << service->output();
     auto sim = startSimulator(phone.ns, {"--iface-ip", phone.ip, "--announce-every", "0", "--duration", "60",
                                          "--id", "SIMPHONE01", "--account", "13800000000"});
     ASSERT_TRUE(sim->waitForOutput("SIM ANNOUNCED", 5s)) << sim->output();

@@ -34,7 +34,7 @@ protected:
         SSDPcancel() = false;
         PcIdentityTest::TearDown();
     }
-    static void clearTable() { SsdpDeviceManager::instance().ssdpDeviceMap.eraseTimeOut(1e18); }
+    static void clearTable() { SsdpDeviceManager::instance().ssdpDeviceMap.clear(); }
     static void addDevice(const std::string& id, std::vector<std::string> ip, const std::string& type = "phone") {
         auto device = std::make_shared<SsdpDevice>();
         device->deviceId = id;

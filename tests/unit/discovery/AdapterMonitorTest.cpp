@@ -1,16 +1,27 @@
 // The adapter monitor over the fake platform: the events and socket rebuilds of adapters
 // coming, going, changing address and power, of a network on which the PC stops hearing
-// itself, the announcement pass on a real loopback socket, and the start-up loop's stop.
+// itself, the announcement pass on a real loopback socket, the rebuild pause as a timer,
+// and the discovery start-up's stop.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sched.h>
+#include <unistd.h>
 
+#include <asio/steady_timer.hpp>
 #include <condition_variable>
+#include <functional>
+#include <future>
 #include <mutex>
+#include <thread>
 
 #include "DiscoveryFixture.h"
+#include "core/EventLoop.h"
 #include "core/Json.h"
+#include "core/Process.h"
 #include "discovery/Base64.h"
 #include "discovery/KesuAdapterManager.h"
 #include "discovery/ServiceWorker.h"
+#include "discovery/SsdpDeviceManager.h"
 #include "discovery/SsdpMessage.h"
 #include "unit/events/EventRecorder.h"
 
@@ -32,6 +43,7 @@ protected:
         env.config().ssdpPort = test::freeUdpPort();
         env.config().ssdpRebuildPause = 0ms;
         EventPublisher::instance().addObserver(events);
+        loop.start();
     }
     void TearDown() override {
         EventPublisher::instance().clearObservers();
@@ -39,6 +51,8 @@ protected:
     }
 
     std::shared_ptr<test::EventRecorder> events = std::make_shared<test::EventRecorder>();
+    EventLoop loop;
+    SsdpDeviceManager devices{64, 30.0, clock};
 };
 
 const Adapter kWlan{"Wi-Fi", "kf-wlan0", "192.168.5.2"};
@@ -47,13 +61,13 @@ const Adapter kEth{"Ethernet", "kf-eth0", "10.1.1.2"};
 TEST_F(AdapterMonitor, StartOpensASocketPerAdapterSilentlyAndTheFirstCheckReportsWifiOn) {
     fake->setWifiPowerOn(true);
     network({kWlan, kEth});
-    KesuAdapterManager monitor;
+    KesuAdapterManager monitor(loop, devices);
     EXPECT_TRUE(events->take().empty());
     EXPECT_EQ(monitor.socketInterfaces(), (Names{"kf-eth0", "kf-wlan0"}));
     EXPECT_EQ(monitor.networkStatus(),
               (std::map<std::string, std::string>{{"Ethernet", "10.1.1.2"}, {"Wi-Fi", "192.168.5.2"}}));
     ASSERT_TRUE(monitor.managerFor("kf-wlan0")->socket());
-    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
+    EXPECT_EQ(devices.lastOwnEcho(), clock.now());
 
     const auto wlanManager = monitor.managerFor("kf-wlan0");
     monitor.checkNetWorkStatus();
@@ -69,7 +83,7 @@ TEST_F(AdapterMonitor, StartOpensASocketPerAdapterSilentlyAndTheFirstCheckReport
 
 TEST_F(AdapterMonitor, UnpluggingAndPluggingEthernetBack) {
     network({kWlan, kEth});
-    KesuAdapterManager monitor;
+    KesuAdapterManager monitor(loop, devices);
     const auto ethManager = monitor.managerFor("kf-eth0");
 
     network({kWlan});
@@ -87,7 +101,7 @@ TEST_F(AdapterMonitor, UnpluggingAndPluggingEthernetBack) {
 
 TEST_F(AdapterMonitor, NewAddressesRebuildTheSocketAndReportDisconnectThenConnect) {
     network({kWlan, kEth});
-    KesuAdapterManager monitor;
+    KesuAdapterManager monitor(loop, devices);
     const auto wlanManager = monitor.managerFor("kf-wlan0");
     const auto ethManager = monitor.managerFor("kf-eth0");
 
@@ -115,7 +129,7 @@ TEST_F(AdapterMonitor, NewAddressesRebuildTheSocketAndReportDisconnectThenConnec
 TEST_F(AdapterMonitor, WifiPowerOffAndOn) {
     fake->setWifiPowerOn(true);
     network({kWlan, kEth});
-    KesuAdapterManager monitor;
+    KesuAdapterManager monitor(loop, devices);
     monitor.checkNetWorkStatus();
     EXPECT_EQ(events->take(), (Events{"WifiOpenEvent"}));
 
@@ -146,7 +160,7 @@ TEST_F(AdapterMonitor, WifiPowerOffAndOn) {
 
 TEST_F(AdapterMonitor, SilentNetworkRebuildsEverySocketOncePerTimeoutAndOwnEchoOnAnyAdapterPreventsIt) {
     network({kWlan, kEth});
-    KesuAdapterManager monitor;
+    KesuAdapterManager monitor(loop, devices);
     auto wlan = monitor.managerFor("kf-wlan0");
     auto eth = monitor.managerFor("kf-eth0");
 
@@ -161,7 +175,7 @@ TEST_F(AdapterMonitor, SilentNetworkRebuildsEverySocketOncePerTimeoutAndOwnEchoO
     EXPECT_NE(monitor.managerFor("kf-eth0"), eth);
     EXPECT_FALSE(wlan->socket());
     EXPECT_FALSE(eth->socket());
-    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());  // reset once for the whole check
+    EXPECT_EQ(devices.lastOwnEcho(), clock.now());  // reset once for the whole check
 
     wlan = monitor.managerFor("kf-wlan0");
     eth = monitor.managerFor("kf-eth0");
@@ -171,7 +185,7 @@ TEST_F(AdapterMonitor, SilentNetworkRebuildsEverySocketOncePerTimeoutAndOwnEchoO
     // One socket heard the PC's own announcement 30 s ago: no socket is rebuilt, although
     // the last rebuild is 70 s old.
     advance(40.0);
-    Utils::setSsdpDetectedLastTime(now());
+    devices.markOwnEcho();
     advance(30.0);
     monitor.checkNetWorkStatus();
     EXPECT_EQ(monitor.managerFor("kf-wlan0"), wlan);
@@ -180,7 +194,7 @@ TEST_F(AdapterMonitor, SilentNetworkRebuildsEverySocketOncePerTimeoutAndOwnEchoO
 
 TEST_F(AdapterMonitor, SocketFollowsItsAdapterToAnotherInterface) {
     network({kWlan, kEth});
-    KesuAdapterManager monitor;
+    KesuAdapterManager monitor(loop, devices);
     const auto eth0 = monitor.managerFor("kf-eth0");
 
     network({kWlan, {"Ethernet", "kf-eth1", "10.1.1.7"}});
@@ -212,12 +226,12 @@ TEST_F(AdapterMonitor, AnnouncesThePcOnEachSocketAndHearsItself) {
     std::condition_variable cv;
     std::vector<std::string> heard;  // by the monitor's own socket, after classification
     auto record = [&](std::string_view data, const std::string& host, std::uint16_t) {
-        SsdpMessage::handleDatagram(data, host);
+        SsdpMessage::handleDatagram(data, host, devices);
         std::lock_guard<std::mutex> l(m);
         heard.emplace_back(data);
         cv.notify_all();
     };
-    KesuAdapterManager monitor(record);
+    KesuAdapterManager monitor(loop, devices, record);
     ASSERT_TRUE(monitor.managerFor("lo"));
     ASSERT_TRUE(monitor.managerFor("lo")->socket()->isReceiving());
 
@@ -227,7 +241,7 @@ TEST_F(AdapterMonitor, AnnouncesThePcOnEachSocketAndHearsItself) {
         std::unique_lock<std::mutex> l(m);
         ASSERT_TRUE(cv.wait_for(l, 10s, [&] { return !heard.empty(); }));
     }
-    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
+    EXPECT_EQ(devices.lastOwnEcho(), clock.now());
 
     const std::string datagram = heard.front();
     ASSERT_TRUE(datagram.starts_with("RESPONSE * HTTP/1.1\r\nDATE:"));
@@ -244,34 +258,119 @@ TEST_F(AdapterMonitor, AnnouncesThePcOnEachSocketAndHearsItself) {
     dataInstance().set(&databaseParam::Phone, savedPhone);
 }
 
-// The start-up loop: its first pass runs at once, and stop() ends it during a long period
-// and a long rebuild pause; a new start opens the sockets again from scratch.
+// A rebuild closes the socket at once and opens the new one when the pause has passed, on
+// the loop and without holding up the check; the new socket announces the PC straight away.
+// A check during the pause does not rebuild again, and an adapter removed meanwhile stays
+// removed.
+TEST_F(AdapterMonitor, RebuildPauseIsATimerAndTheReopenedSocketAnnounces) {
+    env.config().ssdpRebuildPause = 1s;
+    network({{"Ethernet", "lo", ""}});
+    std::mutex m;
+    std::condition_variable cv;
+    int announcements = 0;
+    KesuAdapterManager monitor(loop, devices, [&](std::string_view data, const std::string&, std::uint16_t) {
+        if (!std::string(data).starts_with("RESPONSE * HTTP/1.1")) return;
+        std::lock_guard<std::mutex> l(m);
+        ++announcements;
+        cv.notify_all();
+    });
+    const auto before = monitor.managerFor("lo");
+
+    network({{"Ethernet", "lo", "127.0.0.1"}});
+    monitor.checkNetWorkStatus();  // returns during the pause
+    EXPECT_EQ(events->take(), (Events{"NetworkChangeEvent", "WiredNetConnectEvent"}));
+    EXPECT_FALSE(before->socket());
+    EXPECT_EQ(monitor.managerFor("lo"), before);  // still closed
+    monitor.checkNetWorkStatus();
+    EXPECT_TRUE(events->take().empty());
+    {
+        std::unique_lock<std::mutex> l(m);
+        ASSERT_TRUE(cv.wait_for(l, 10s, [&] { return announcements > 0; }));
+    }
+    ASSERT_NE(monitor.managerFor("lo"), before);
+    EXPECT_TRUE(monitor.managerFor("lo")->socket()->isReceiving());
+
+    // Readdressed and then removed within one pause: nothing reopens once the pause is over
+    // (a timer armed after the rebuild's fires after it).
+    network({{"Ethernet", "lo", "127.0.0.2"}});
+    monitor.checkNetWorkStatus();
+    network({});
+    monitor.checkNetWorkStatus();
+    EXPECT_EQ(events->take(), (Events{"NetworkChangeEvent", "WiredNetDisconnectEvent", "WiredNetConnectEvent",
+                                      "NetworkChangeEvent", "WiredNetDisconnectEvent"}));
+    std::promise<void> pauseOver;
+    asio::steady_timer later(loop.context(), 1500ms);
+    later.async_wait([&](const asio::error_code&) { pauseOver.set_value(); });
+    ASSERT_EQ(pauseOver.get_future().wait_for(10s), std::future_status::ready);
+    EXPECT_TRUE(monitor.socketInterfaces().empty());
+    std::lock_guard<std::mutex> l(m);
+    EXPECT_EQ(announcements, 1);
+}
+
+// The start-up: its first pass runs at once, and stop() ends it during a long period and a
+// long rebuild pause; a new start opens the sockets again from scratch.
 TEST_F(AdapterMonitor, ServiceWorkerStopsAtOnceAndStartsAfresh) {
     env.config().ssdpAnnouncePeriod = std::chrono::hours(1);
     env.config().ssdpRebuildPause = std::chrono::hours(1);
     env.config().ssdpSelfEchoTimeout = 0ms;  // every check rebuilds...
-    std::atomic<double> ticking{kStart};
-    Utils::setClock([&ticking] {  // ...as each reading of the clock is a second later
-        return Utils::Clock::time_point(std::chrono::duration_cast<Utils::Clock::duration>(
-            std::chrono::duration<double>(ticking.fetch_add(1.0))));
-    });
+    struct TickingClock : SteadyClock {       // ...as each reading of the clock is a second later
+        time_point now() const override { return time_point(std::chrono::seconds(++ticks)); }
+        mutable std::atomic<int> ticks{0};
+    } ticking;
+    SsdpDeviceManager table(64, 30.0, ticking);
     fake->setWifiPowerOn(true);
     network({kEth});
 
-    ServiceWorker worker;
+    ServiceWorker worker(loop, table);
     for (int round = 0; round < 2; ++round) {
         worker.start();
         EXPECT_TRUE(worker.isRunning());
-        EXPECT_TRUE(KesuAdapterManager::instance().isActive());
+        ASSERT_TRUE(worker.adapters());
+        EXPECT_TRUE(worker.adapters()->isActive());
         ASSERT_TRUE(events->waitFor("WifiOpenEvent", 1, 10s));  // the check has begun
         worker.stop();
         EXPECT_FALSE(worker.isRunning());
-        EXPECT_FALSE(KesuAdapterManager::instance().isActive());
-        EXPECT_TRUE(KesuAdapterManager::instance().socketInterfaces().empty());
+        EXPECT_FALSE(worker.adapters());
         EXPECT_EQ(events->take(), (Events{"WifiOpenEvent"}));
     }
     worker.stop();  // a second stop is harmless
-    Utils::setClock({});
+}
+
+// A new address in a network namespace reaches the running discovery through the kernel's
+// change notification: announced on it long before the (here one hour) announce period.
+TEST_F(AdapterMonitor, KernelChangeNotificationTriggersACheckAtOnce) {
+    if (::geteuid() != 0) GTEST_SKIP() << "network namespaces need root";
+    const std::string ns = "kesu-lc-" + std::to_string(::getpid());
+    auto ip = [](const std::vector<std::string>& args) {
+        const auto r = process::run("ip", args, 10s);
+        return r && r->exitStatus == 0;
+    };
+    ASSERT_TRUE(ip({"netns", "add", ns}));
+    struct Cleanup {
+        std::function<void()> fn;
+        ~Cleanup() { fn(); }
+    } cleanup{[&] { ip({"netns", "del", ns}); }};
+    ASSERT_TRUE(ip({"-n", ns, "link", "set", "lo", "up"}));
+    env.config().ssdpAnnouncePeriod = std::chrono::hours(1);
+    fake->setWifiPowerOn(true);
+    network({});
+
+    ServiceWorker worker(loop, devices);
+    std::thread([&] {  // the worker's sockets and listener open in the namespace
+        const int fd = ::open(("/run/netns/" + ns).c_str(), O_RDONLY | O_CLOEXEC);
+        if (fd >= 0 && ::setns(fd, CLONE_NEWNET) == 0) worker.start();
+        if (fd >= 0) ::close(fd);
+    }).join();
+    ASSERT_TRUE(worker.isRunning());
+    ASSERT_TRUE(events->waitFor("WifiOpenEvent", 1, 10s));  // the first pass is over
+    ASSERT_TRUE(worker.adapters()->socketInterfaces().empty());
+
+    // The fake platform reports the adapter; the kernel's notification says when to look.
+    network({{"Ethernet", "kf-lc0", "10.77.9.1"}});
+    ASSERT_TRUE(ip({"-n", ns, "link", "add", "kf-lc0", "type", "veth", "peer", "name", "kf-lc1"}));
+    ASSERT_TRUE(events->waitFor("WiredNetConnectEvent", 1, 10s));
+    EXPECT_EQ(worker.adapters()->socketInterfaces(), (Names{"kf-lc0"}));
+    worker.stop();
 }
 
 }  // namespace

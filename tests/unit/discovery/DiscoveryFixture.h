@@ -1,6 +1,6 @@
 // Shared set-up of the discovery tests: a hermetic home for the log, the fake platform with
-// a known host name and settable adapters, a clock the test moves by hand, the signed-in
-// account's open id, and phones' announcements.
+// a known host name and settable adapters, a wall clock and a monotonic clock the test moves
+// by hand, the signed-in account's open id, and phones' announcements.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -12,6 +12,7 @@
 
 #include "account/DataInstance.h"
 #include "core/Json.h"
+#include "core/SteadyClock.h"
 #include "core/Utils.h"
 #include "discovery/Base64.h"
 #include "platform/fake/FakePlatform.h"
@@ -63,7 +64,14 @@ protected:
         Utils::closeLog();
     }
 
-    void advance(double s) { seconds_.store(seconds_.load() + s); }
+    // Time passes: both clocks move.
+    void advance(double s) {
+        stepWallClock(s);
+        clock.advance(std::chrono::duration_cast<SteadyClock::duration>(std::chrono::duration<double>(s)));
+    }
+    // The wall clock alone is set forward or back (NTP, a user's change).
+    void stepWallClock(double s) { seconds_.store(seconds_.load() + s); }
+    // The wall clock's reading, seconds.
     double now() const { return seconds_.load(); }
 
     // Replaces the fake machine's adapters and their addresses.
@@ -80,6 +88,7 @@ protected:
 
     HermeticEnv env;
     ScopedFakePlatform fake;
+    ManualClock clock;  // the clock of durations
 
 private:
     std::atomic<double> seconds_{kStart};

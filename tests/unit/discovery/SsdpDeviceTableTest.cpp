@@ -1,5 +1,6 @@
-// The discovered-device table: map operations, the strict 30-second expiry, the bound with
-// eviction of the oldest entry, the query answer, and concurrent use.
+// The discovered-device table: map operations, the strict 30-second expiry on the monotonic
+// clock (wall-clock steps change nothing), the bound with eviction of the oldest entry, the
+// query answer, and concurrent use.
 #include <gtest/gtest.h>
 
 #include <memory>
@@ -10,16 +11,18 @@
 #include "DiscoveryFixture.h"
 #include "core/Json.h"
 #include "discovery/SsdpDeviceManager.h"
+#include "discovery/SsdpMessage.h"
 #include "discovery/SsdpSafemap.h"
 
 namespace kesu {
 namespace {
 
-SsdpDevicePtr device(const std::string& id, double lastUpdate, const std::string& name = "Phone") {
+using namespace std::chrono_literals;
+
+SsdpDevicePtr device(const std::string& id, const std::string& name = "Phone") {
     auto d = std::make_shared<SsdpDevice>();
     d->deviceId = id;
     d->deviceName = name;
-    d->lastUpdate = lastUpdate;
     d->ip = {"10.0.0.1"};
     return d;
 }
@@ -27,56 +30,99 @@ SsdpDevicePtr device(const std::string& id, double lastUpdate, const std::string
 using SsdpDeviceTableTest = test::DiscoveryTest;
 
 TEST_F(SsdpDeviceTableTest, MapOperations) {
-    SsdpSafemap map(16, 30.0);
-    SsdpDevicePtr out = device("keep", 1.0);
+    SsdpSafemap map(16, 30.0, clock);
+    SsdpDevicePtr out = device("keep");
     EXPECT_FALSE(map.lookup("a", out));
     EXPECT_EQ(out->deviceId, "keep");  // untouched
-    EXPECT_FALSE(map.update("a", device("a", 1.0)));
+    EXPECT_FALSE(map.update("a", device("a")));
     EXPECT_EQ(map.size(), 0u);
 
-    EXPECT_TRUE(map.insert("a", device("a", 1.0, "first")));
-    EXPECT_TRUE(map.insert("a", device("a", 3.0, "third"), true));  // replaces
+    EXPECT_TRUE(map.insert("a", device("a", "first")));
+    EXPECT_TRUE(map.insert("a", device("a", "third"), true));  // replaces
     ASSERT_TRUE(map.lookup("a", out));
     const SsdpDevicePtr held = out;
-    EXPECT_TRUE(map.update("a", device("a", 4.0, "fourth")));
+    EXPECT_TRUE(map.update("a", device("a", "fourth")));
     ASSERT_TRUE(map.lookup("a", out));
     EXPECT_EQ(out->deviceName, "fourth");
     EXPECT_EQ(held->deviceName, "third");  // a holder keeps its snapshot
     EXPECT_FALSE(map.insert("b", nullptr));
     EXPECT_EQ(map.size(), 1u);
-}
-
-TEST_F(SsdpDeviceTableTest, ExpiryIsStrictlyGreater) {
-    SsdpSafemap map(16, 30.0);
-    map.insert("old", device("old", 100.0, "Old Phone"));
-    map.insert("new", device("new", 110.0));
-    map.insert("zero", device("zero", 0.0));  // never stamped
-    EXPECT_TRUE(map.eraseTimeOut(130.0));      // only "zero" goes; "old" is exactly 30 s old
-    EXPECT_EQ(map.size(), 2u);
-    EXPECT_TRUE(map.eraseTimeOut(130.001));
-    EXPECT_EQ(map.size(), 1u);
-    EXPECT_FALSE(map.eraseTimeOut(130.002));   // reported once
-    // A refresh moves the entry's age forward.
-    map.update("new", device("new", 135.0));
-    EXPECT_FALSE(map.eraseTimeOut(150.0));
-    EXPECT_TRUE(map.eraseTimeOut(165.5));
+    map.clear();
     EXPECT_EQ(map.size(), 0u);
 }
 
+TEST_F(SsdpDeviceTableTest, ExpiryIsStrictlyGreater) {
+    SsdpSafemap map(16, 30.0, clock);
+    map.insert("old", device("old", "Old Phone"));
+    clock.advance(10s);
+    map.insert("new", device("new"));
+    clock.advance(20s);
+    EXPECT_FALSE(map.eraseTimeOut());  // "old" is exactly 30 s old
+    clock.advance(1ms);
+    EXPECT_TRUE(map.eraseTimeOut());
+    EXPECT_EQ(map.size(), 1u);
+    EXPECT_FALSE(map.eraseTimeOut());  // reported once
+    // A refresh moves the entry's age forward.
+    map.update("new", device("new"));
+    clock.advance(30s);
+    EXPECT_FALSE(map.eraseTimeOut());
+    clock.advance(1ms);
+    EXPECT_TRUE(map.eraseTimeOut());
+    EXPECT_EQ(map.size(), 0u);
+}
+
+// The wall clock steps an hour back and then two forward while a phone keeps announcing
+// every 5 s and another fell silent: the live one stays, the silent one goes after its 30 s,
+// and the record still carries the wall-clock time of its announcement.
+TEST_F(SsdpDeviceTableTest, WallClockStepsNeitherExpireLiveDevicesNorKeepSilentOnes) {
+    SsdpDeviceManager table(16, 30.0, clock);
+    const auto hear = [&](const std::string& id) {
+        SsdpMessage::insertResponseDevice(json::compact(test::phoneBody(id)), "10.0.0.9", "", true, table);
+    };
+    const auto present = [&](const std::string& key) {
+        SsdpDevicePtr d;
+        return table.ssdpDeviceMap.lookup(key, d);
+    };
+    hear("live");
+    hear("gone");
+    for (int round = 1; round <= 6; ++round) {  // 30 s: "gone" is exactly at its expiry
+        advance(5);
+        if (round == 2) stepWallClock(-3600);
+        if (round == 4) stepWallClock(+7200);
+        hear("live");
+        EXPECT_FALSE(table.deleteDevices()) << "round " << round;
+    }
+    EXPECT_TRUE(present("676f6e65"));
+    advance(0.001);
+    EXPECT_TRUE(table.deleteDevices());
+    EXPECT_FALSE(present("676f6e65"));
+    SsdpDevicePtr live;
+    ASSERT_TRUE(table.ssdpDeviceMap.lookup("6c697665", live));
+    EXPECT_DOUBLE_EQ(live->lastUpdate, kStart + 3600 + 30);  // shown as the wall clock read it
+}
+
 TEST_F(SsdpDeviceTableTest, BoundEvictsTheOldest) {
-    SsdpSafemap map(4, 30.0);
-    for (int i = 0; i < 4; ++i) map.insert("d" + std::to_string(i), device("d" + std::to_string(i), 10.0 + i));
-    map.update("d0", device("d0", 20.0));  // d1 is now the one heard longest ago
-    map.insert("d2", device("d2", 21.0));  // a present key never evicts
+    SsdpSafemap map(4, 30.0, clock);
+    for (int i = 0; i < 4; ++i) {
+        map.insert("d" + std::to_string(i), device("d" + std::to_string(i)));
+        clock.advance(1s);
+    }
+    map.update("d0", device("d0"));  // d1 is now the one heard longest ago
+    clock.advance(1s);
+    map.insert("d2", device("d2"));  // a present key never evicts
     EXPECT_EQ(map.evictedCount(), 0u);
-    map.insert("n", device("n", 22.0));
+    clock.advance(1s);
+    map.insert("n", device("n"));
     SsdpDevicePtr out;
     EXPECT_FALSE(map.lookup("d1", out));
     EXPECT_TRUE(map.lookup("d0", out));
     EXPECT_EQ(map.size(), 4u);
 
     // A flood of distinct ids churns the table without growing it and logs once.
-    for (int i = 0; i < 5000; ++i) map.insert("f" + std::to_string(i), device("f", 30.0 + i * 0.001));
+    for (int i = 0; i < 5000; ++i) {
+        clock.advance(1ms);
+        map.insert("f" + std::to_string(i), device("f"));
+    }
     EXPECT_EQ(map.size(), 4u);
     EXPECT_EQ(map.evictedCount(), 5001u);
     EXPECT_TRUE(map.lookup("f4999", out));
@@ -87,14 +133,16 @@ TEST_F(SsdpDeviceTableTest, BoundEvictsTheOldest) {
 }
 
 TEST_F(SsdpDeviceTableTest, QueryAllSweepsFirst) {
-    SsdpDeviceManager manager(16, 30.0);
+    SsdpDeviceManager manager(16, 30.0, clock);
     std::string res;
     ASSERT_TRUE(manager.getQueryAll(res));
     EXPECT_EQ(Json::parse(res), Json::parse(R"({"error":0,"error_message":"","data":[]})"));
     EXPECT_NE(res.find('\n'), std::string::npos);  // pretty-printed
 
-    manager.ssdpDeviceMap.insert("stale", device("stale", now() - 31.0));
-    manager.ssdpDeviceMap.insert("fresh", device("fresh", now() - 29.0, "Tab"));
+    manager.ssdpDeviceMap.insert("stale", device("stale"));
+    clock.advance(2s);
+    manager.ssdpDeviceMap.insert("fresh", device("fresh", "Tab"));
+    clock.advance(29s);
     ASSERT_TRUE(manager.getQueryAll(res));
     const Json answer = Json::parse(res);
     ASSERT_EQ(answer["data"].size(), 1u);
@@ -108,7 +156,7 @@ TEST_F(SsdpDeviceTableTest, QueryAllSweepsFirst) {
 // Writers, the sweep and readers at once, as the adapter sockets, the expiry loop and the
 // control API do. Run under TSan; the bound must hold throughout.
 TEST_F(SsdpDeviceTableTest, ConcurrentUse) {
-    SsdpDeviceManager manager(32, 30.0);
+    SsdpDeviceManager manager(32, 30.0, clock);
     std::atomic<int> observed{0};
     manager.addChangeObserver([&](const SsdpDevice& d) {
         SsdpDevicePtr stored;
@@ -119,7 +167,7 @@ TEST_F(SsdpDeviceTableTest, ConcurrentUse) {
     for (int t = 0; t < 3; ++t) {
         threads.emplace_back([&, t] {
             for (int i = 0; i < 400; ++i) {
-                auto d = device(std::to_string(t) + "-" + std::to_string(i % 50), static_cast<double>(i));
+                auto d = device(std::to_string(t) + "-" + std::to_string(i % 50));
                 manager.notifyChange(*d);
                 manager.ssdpDeviceMap.insert(d->deviceId, d);
             }
@@ -128,7 +176,8 @@ TEST_F(SsdpDeviceTableTest, ConcurrentUse) {
     threads.emplace_back([&] {
         std::string res;
         for (int i = 0; i < 200; ++i) {
-            manager.ssdpDeviceMap.eraseTimeOut(200.0 + i);
+            clock.advance(1s);
+            manager.ssdpDeviceMap.eraseTimeOut();
             manager.getQueryAll(res);
             EXPECT_LE(manager.ssdpDeviceMap.size(), 32u);
         }

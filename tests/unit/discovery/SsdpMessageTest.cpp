@@ -127,24 +127,24 @@ TEST_F(SsdpMessageTest, OldFormatParse) {
 }
 
 TEST_F(SsdpMessageTest, DatagramClassification) {
-    SsdpDeviceManager table(64, 30.0);
+    SsdpDeviceManager table(64, 30.0, clock);
     const std::string host = "10.77.0.5";
 
     EXPECT_EQ(SsdpMessage::handleDatagram(announce(phone("ph01")), host, table), Handling::currentFormat);
     EXPECT_EQ(table.ssdpDeviceMap.size(), 1u);
-    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), 0.0);
+    EXPECT_EQ(table.lastOwnEcho(), SteadyClock::time_point());
 
     // The PC's own announcement looped back: not stored, but it proves the socket hears.
     const std::string own = SsdpMessage::responseMessage(Utils::getLocalName(), "a1b2c3", "", "oid",
                                                          SsdpMessage::pcServiceRecord());
     EXPECT_EQ(SsdpMessage::handleDatagram(own, host, table), Handling::ignored);
-    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
+    EXPECT_EQ(table.lastOwnEcho(), clock.now());
     // So does a phone announcement that merely holds the PC's name somewhere.
     advance(5);
     Json naming = phone("ph02");
     naming["pcCustomizedData"] = "for Off****-PC";
     EXPECT_EQ(SsdpMessage::handleDatagram(announce(naming), host, table), Handling::currentFormat);
-    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
+    EXPECT_EQ(table.lastOwnEcho(), clock.now());
 
     // Old-format markers win over the current format.
     EXPECT_EQ(SsdpMessage::handleDatagram(kOld + "compatGsonStr:" + base64::encode("{}") + "\r\n", host, table),

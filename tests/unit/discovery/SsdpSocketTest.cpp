@@ -14,6 +14,7 @@
 #include <thread>
 
 #include "DiscoveryFixture.h"
+#include "core/EventLoop.h"
 #include "core/Process.h"
 #include "discovery/KesuAdapterManager.h"
 #include "discovery/SsdpDeviceManager.h"
@@ -101,17 +102,23 @@ Json queryAll() { return test::control("SSDPQueryAll")["data"]; }
 
 class SsdpSocketTest : public test::DiscoveryTest {
 protected:
+    void SetUp() override {
+        DiscoveryTest::SetUp();
+        loop.start();
+    }
     void TearDown() override {
-        SsdpDeviceManager::instance().ssdpDeviceMap.eraseTimeOut(1e300);  // the table is process-wide
+        SsdpDeviceManager::instance().ssdpDeviceMap.clear();  // the table is process-wide
         DiscoveryTest::TearDown();
     }
+
+    EventLoop loop;
 };
 
 TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
     env.config().ssdpPort = test::freeUdpPort();
     env.config().ssdpMaxDatagram = 1024;
     Recorder pcHeard(/*classify=*/true);
-    SsdpSocketManager pc(pcHeard.receiver());
+    SsdpSocketManager pc(loop, pcHeard.receiver());
     EXPECT_FALSE(pc.sendResponseData("n", "id", "acc", "open", "svc"));  // no socket yet
     pc.createSocket("lo");
     const std::shared_ptr<SsdpSocket> socket = pc.socket();
@@ -141,13 +148,13 @@ TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
 
     // The PC's own announcement comes back on its socket: it refreshes the own-echo time
     // stamp and is not stored.
-    Utils::setSsdpDetectedLastTime(0.0);
+    const auto beforeEcho = SteadyClock::system().now();
     ASSERT_TRUE(pc.sendResponseData(Utils::getLocalName(), Utils::getMacAddress(), "", "openid-of-this-pc",
                                     SsdpMessage::pcServiceRecord()));
     heard = pcHeard.waitFor(3);
     ASSERT_EQ(heard.size(), 3u);
     EXPECT_TRUE(heard[2].data.starts_with("RESPONSE * HTTP/1.1\r\nDATE:"));
-    EXPECT_EQ(Utils::getSsdpDetectedLastTime(), now());
+    EXPECT_GE(SsdpDeviceManager::instance().lastOwnEcho(), beforeEcho);
 
     EXPECT_FALSE(socket->sendMsg(std::string("\xff\xfe")));  // not UTF-8
 
@@ -163,7 +170,7 @@ TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
 TEST_F(SsdpSocketTest, FailedSetUpIsLoggedAndLeavesASocketThatNeitherHearsNorSends) {
     env.config().ssdpPort = test::freeUdpPort();
     {
-        SsdpSocket missing("kf-none0");
+        SsdpSocket missing(loop, "kf-none0");
         EXPECT_FALSE(missing.isReceiving());
         EXPECT_FALSE(missing.isSocketNull());  // created and bound: it exists
         // Without its interface the system would send through another adapter.
@@ -171,20 +178,20 @@ TEST_F(SsdpSocketTest, FailedSetUpIsLoggedAndLeavesASocketThatNeitherHearsNorSen
     }
 
     env.config().ssdpGroup = "10.77.0.9";  // not a multicast group
-    SsdpSocket notAGroup("lo");
+    SsdpSocket notAGroup(loop, "lo");
     EXPECT_FALSE(notAGroup.isReceiving());
     EXPECT_FALSE(notAGroup.sendMsg("hello"));
 }
 
 // Sockets of one port side by side, rebuilt in a row, closed while another thread sends,
-// and one closed from its own receiver.
+// and one closed from its own receiver (on the loop).
 TEST_F(SsdpSocketTest, SharedPortRebuildsAndCloseFromAnyThread) {
     env.config().ssdpPort = test::freeUdpPort();
     Recorder keeper(false);
-    SsdpSocket listener("lo", keeper.receiver());  // stays up across the rebuilds
+    SsdpSocket listener(loop, "lo", keeper.receiver());  // stays up across the rebuilds
     ASSERT_TRUE(listener.isReceiving());
 
-    SsdpSocketManager manager;
+    SsdpSocketManager manager(loop);
     for (int i = 0; i < 10; ++i) {
         manager.createSocket("lo");  // replaces, and so closes, the previous socket
         ASSERT_TRUE(manager.socket()->isReceiving()) << "rebuild " << i;
@@ -203,7 +210,7 @@ TEST_F(SsdpSocketTest, SharedPortRebuildsAndCloseFromAnyThread) {
 
     std::atomic<SsdpSocket*> self{nullptr};
     std::promise<void> closedItself;
-    SsdpSocket selfClosing("lo", [&](std::string_view, const std::string&, std::uint16_t) {
+    SsdpSocket selfClosing(loop, "lo", [&](std::string_view, const std::string&, std::uint16_t) {
         if (SsdpSocket* s = self.exchange(nullptr)) {
             s->close();
             closedItself.set_value();
@@ -298,7 +305,7 @@ TEST_F(SsdpSocketTest, NetnsEachAdapterSocketHearsAndSpeaksOnlyOnItsOwnNetwork) 
     // The real discovery port: nothing else listens inside these namespaces.
     Recorder pcA(true), pcB(true), phoneA(false), phoneB(false);
     auto socketOn = [&](const std::string& role, const std::string& netCard, Recorder& recorder) {
-        return lab.inside(role, [&] { return std::make_unique<SsdpSocket>(netCard, recorder.receiver()); });
+        return lab.inside(role, [&] { return std::make_unique<SsdpSocket>(loop, netCard, recorder.receiver()); });
     };
     auto pcSocketA = socketOn("pc", "kf-a0", pcA);
     auto pcSocketB = socketOn("pc", "kf-b0", pcB);
@@ -339,7 +346,7 @@ TEST_F(SsdpSocketTest, NetnsEachAdapterSocketHearsAndSpeaksOnlyOnItsOwnNetwork) 
     // The adapter monitor's announcement leaves on each adapter, the first datagram of each
     // new socket included, although only kf-a0 has a multicast route.
     network({{"Wi-Fi", "kf-a0", "10.77.0.1", "255.255.255.252"}, {"Ethernet", "kf-b0", "10.77.0.5", "255.255.255.252"}});
-    auto monitor = lab.inside("pc", [] { return std::make_unique<KesuAdapterManager>(); });
+    auto monitor = lab.inside("pc", [&] { return std::make_unique<KesuAdapterManager>(loop); });
     ASSERT_TRUE(monitor);
     EXPECT_EQ(monitor->socketInterfaces(), (std::vector<std::string>{"kf-a0", "kf-b0"}));
     monitor->sendSsdp();

@@ -92,7 +92,7 @@ protected:
     }
 
     test::StubPcSuite pcsuite;
-    SsdpDeviceManager table{64, 30.0};
+    SsdpDeviceManager table{64, 30.0, clock};
 };
 
 TEST_F(DeviceReportsTest, OnlyNewDevicesAndAccountGuideOpenIdChangesCount) {
@@ -291,7 +291,7 @@ TEST_F(DeviceReportsTest, ServiceStartWiresTheLanReports) {
     env.config().phoneTcpPort = test::freeTcpPort();
     env.config().ssdpPort = test::freeTcpPort();
     SsdpDeviceManager& global = SsdpDeviceManager::instance();
-    global.ssdpDeviceMap.eraseTimeOut(1e300);
+    global.ssdpDeviceMap.clear();
 
     EventLoop loop;
     loop.start();
@@ -312,7 +312,7 @@ TEST_F(DeviceReportsTest, ServiceStartWiresTheLanReports) {
     WlanDetectedDeviceCompare::instance().notifySubscribers();
     SsdpMessage::insertResponseDevice(json::compact(phoneBody("bbbb")), "10.0.0.2", "openid-of-this-pc", true);
     EXPECT_FALSE(waitForPath(pcsuite, kLanPath, 4, 300ms));
-    global.ssdpDeviceMap.eraseTimeOut(1e300);
+    global.ssdpDeviceMap.clear();
 }
 
 }  // namespace
