@@ -145,10 +145,9 @@ void SocketServer::onAccept(asio::ip::tcp::socket socket) {
 void SocketServer::linkEnded(const std::shared_ptr<PhoneLink>& link) {
     link->shut();
     links_.erase(link);
-    {
-        std::lock_guard<std::mutex> lock(countMutex_);
-        openLinks_ = links_.size();
-    }
+    // Notified under the lock: a stop() waiting for this may destroy the server right after.
+    std::lock_guard<std::mutex> lock(countMutex_);
+    openLinks_ = links_.size();
     countChanged_.notify_all();
 }
 

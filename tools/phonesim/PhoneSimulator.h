@@ -102,7 +102,9 @@ enum class Answer {
 std::optional<Answer> answerNamed(const std::string& name);
 
 // A phone listening for PCs' connection requests; each link gets one answer (for its first
-// request) and is kept until the PC closes it.
+// request) and is kept until the PC closes it. (A held link of a pre-connection is the same
+// shape: a further Answer that replies to its request and keeps sending on the held link
+// fits in onData.)
 class Listener {
 public:
     struct Options {
