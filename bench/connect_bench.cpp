@@ -10,8 +10,6 @@
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <netinet/in.h>
-#include <netinet/tcp.h>
-#include <poll.h>
 #include <sched.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -27,6 +25,7 @@
 #include "BenchSupport.h"
 #include "connect/PhoneFrame.h"
 #include "discovery/SsdpMessage.h"
+#include "phonesim/PhoneSimulator.h"
 
 namespace {
 
@@ -61,66 +60,12 @@ void inPhoneNamespace(const std::function<void()>& fn) {
     }).join();
 }
 
-int listenOn(int port) {
-    const int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    int one = 1;
-    ::setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
-    sockaddr_in a{};
-    a.sin_family = AF_INET;
-    a.sin_port = htons(static_cast<uint16_t>(port));
-    ::inet_pton(AF_INET, kPhoneIp, &a.sin_addr);
-    if (::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0 || ::listen(fd, 16) != 0) return -1;
-    return fd;
-}
-
-bool writeAll(int fd, const kesu::Bytes& bytes) {
-    for (std::size_t off = 0; off < bytes.size();) {
-        const ssize_t n = ::send(fd, bytes.data() + off, bytes.size() - off, MSG_NOSIGNAL);
-        if (n <= 0) return false;
-        off += static_cast<std::size_t>(n);
-    }
-    return true;
-}
-
-// The phone's side of each link on `listener`: read one whole frame, answer with `answer`
-// (or, when empty, echo the frame), then wait for the peer to close. Ends when the listener
-// is shut down.
-void servePhone(int listener, const kesu::Bytes& answer) {
-    for (;;) {
-        const int c = ::accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
-        if (c < 0) return;
-        int one = 1;
-        ::setsockopt(c, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
-        kesu::FrameCutter cutter{1 << 20};
-        char buf[4096];
-        ssize_t n;
-        bool answered = false;
-        while ((n = ::recv(c, buf, sizeof buf, 0)) > 0) {
-            cutter.feed(std::string_view(buf, static_cast<std::size_t>(n)));
-            if (auto frame = cutter.next(); frame && !answered) answered = writeAll(c, answer.empty() ? *frame : answer);
-        }
-        ::close(c);
-    }
-}
-
 // Raw baseline: a new TCP link to the phone, one request-sized frame out and back, close.
 double rawExchange(const kesu::Bytes& frame) {
     const auto t0 = Clock::now();
-    const int s = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    int one = 1;
-    ::setsockopt(s, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
-    sockaddr_in a{};
-    a.sin_family = AF_INET;
-    a.sin_port = htons(kEchoPort);
-    ::inet_pton(AF_INET, kPhoneIp, &a.sin_addr);
-    if (::connect(s, reinterpret_cast<sockaddr*>(&a), sizeof a) == 0 && writeAll(s, frame)) {
-        std::vector<char> buf(frame.size());
-        std::size_t got = 0;
-        ssize_t n;
-        while (got < frame.size() && (n = ::recv(s, buf.data() + got, frame.size() - got, 0)) > 0)
-            got += static_cast<std::size_t>(n);
-    }
-    ::close(s);
+    std::string error, echoed;
+    if (auto link = kesu::phonesim::Link::dial(kPhoneIp, kEchoPort, error); link && link->send(frame))
+        link->read(echoed, std::chrono::seconds(5));
     return micros(Clock::now() - t0);
 }
 
@@ -143,21 +88,27 @@ int main(int argc, char** argv) {
         std::fprintf(stderr, "connect_bench needs root for network namespaces\n");
         return 1;
     }
-    int phoneListener = -1, echoListener = -1, udp = -1;
+    // The phone: accepts every connection request on 10191, echoes frames on the baseline port.
+    std::unique_ptr<kesu::phonesim::Listener> phone, echo;
+    int udp = -1;
     inPhoneNamespace([&] {
-        phoneListener = listenOn(10191);
-        echoListener = listenOn(kEchoPort);
+        kesu::phonesim::Listener::Options options;
+        options.host = kPhoneIp;
+        options.port = 10191;
+        options.maxLinks = 64;
+        phone = std::make_unique<kesu::phonesim::Listener>(options);
+        options.port = kEchoPort;
+        options.answer = kesu::phonesim::Answer::Echo;
+        echo = std::make_unique<kesu::phonesim::Listener>(options);
         udp = ::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
         in_addr iface{};
         ::inet_pton(AF_INET, kPhoneIp, &iface);
         ::setsockopt(udp, IPPROTO_IP, IP_MULTICAST_IF, &iface, sizeof iface);
     });
-    if (phoneListener < 0 || echoListener < 0 || udp < 0) {
+    if (!phone || !echo || !phone->ok() || !echo->ok() || udp < 0) {
         std::fprintf(stderr, "phone sockets could not be set up\n");
         return 1;
     }
-    std::thread phone(servePhone, phoneListener, kesu::buildPhoneFrameFromJson(Json{{"bytes", {1}}}));
-    std::thread echo(servePhone, echoListener, kesu::Bytes{});
 
     int status = 1;
     {
@@ -239,10 +190,8 @@ int main(int argc, char** argv) {
             status = failures == 0 ? 0 : 2;
         }
     }
-    ::shutdown(phoneListener, SHUT_RDWR);
-    ::shutdown(echoListener, SHUT_RDWR);
-    phone.join();
-    echo.join();
+    phone.reset();
+    echo.reset();
     shell(std::string("ip netns del ") + kPhoneNs);
     shell(std::string("ip netns del ") + kPcNs);
     return status;

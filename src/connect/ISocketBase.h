@@ -1,5 +1,5 @@
 // The blocking socket interface that a remote device record holds as its link to a phone;
-// TcpSocketBase (stream) and UdpSocketBase (datagrams) implement it.
+// UdpSocketBase (datagrams) implements it.
 #pragma once
 
 #include <cstdint>

@@ -3,6 +3,7 @@
 #include "account/DataInstance.h"
 #include "connect/AllowWindow.h"
 #include "core/Config.h"
+#include "core/EventLoop.h"
 #include "core/Json.h"
 #include "core/Utils.h"
 #include "pcsuite/BuryPoint.h"
@@ -47,8 +48,8 @@ std::vector<std::string> LaunchService::pcSuiteArguments(const std::string& ip, 
             "--as=" + sameAccount};
 }
 
-void LaunchService::launchService(const std::string& ip, const std::string& localIp, AppSource appSource,
-                                  const PhoneConnectRequest& request, const SendTcp& sendTcp) {
+asio::awaitable<void> LaunchService::launchService(std::string ip, std::string localIp, AppSource appSource,
+                                                   PhoneConnectRequest request, SendTcp sendTcp) {
     Utils::mPrintlog("[launchService] mac receive LAN connection \n");
     const bool forPcsuite = appSource == AppSource::pcsuite;
     if (forPcsuite) {
@@ -57,28 +58,45 @@ void LaunchService::launchService(const std::string& ip, const std::string& loca
         Utils::setIsAllowWindow(false);
         Utils::setThisPhoneAutoConnect(false);
 
-        std::string respondDeviceType;
-        std::string connectStatus;
-        if (!Utils::isDeviceConnectable(request.deviceType, respondDeviceType, connectStatus)) {
-            if (respondDeviceType == request.deviceType) {
+        struct Busy {
+            bool connectable = false;
+            std::string respondDeviceType;
+            std::string connectStatus;
+        };
+        auto askPcSuite = [&request] {
+            Busy answer;
+            answer.connectable =
+                Utils::isDeviceConnectable(request.deviceType, answer.respondDeviceType, answer.connectStatus);
+            return answer;
+        };
+        const Busy busy = co_await loop_.runBlocking(std::move(askPcSuite));
+        if (!busy.connectable) {
+            if (busy.respondDeviceType == request.deviceType) {
                 Utils::mPrintlog("[launchService] PC has connected other device, same deviceType busy!\n");
-                sendTcp(ConnectTag::BUSY, serviceId::pcsuiteId);
+                co_await sendTcp(ConnectTag::BUSY, serviceId::pcsuiteId);
             } else {
                 Utils::mPrintlog("[launchService] PC has connected other device, different deviceType busy!\n");
-                sendTcp(ConnectTag::DIFFDEVICEBUSY, serviceId::pcsuiteId);
+                co_await sendTcp(ConnectTag::DIFFDEVICEBUSY, serviceId::pcsuiteId);
                 Utils::mPrintlog("[launchService] Final finished\n");
             }
-            return;
+            co_return;
         }
     }
 
     const BuryPoint::Record record = BuryPoint::listRecord("W688|10159", Json::object(), Json{{"finish", 1}});
     const std::string buryPointStr = BuryPoint::listText(record, true);
     Utils::mPrintlog("[launchService] sendBuryPoint buryPointStr is: " + buryPointStr);
-    if (Utils::sendBuryPoint(buryPointStr)) Utils::mPrintlog("[launchService] sendBuryPoint success \n");
+    auto sendBuryPoint = [&buryPointStr] {
+        if (Utils::sendBuryPoint(buryPointStr)) Utils::mPrintlog("[launchService] sendBuryPoint success \n");
+    };
+    co_await loop_.runBlocking(std::move(sendBuryPoint));
 
-    const int exitCode = startAllowedWindow(appSource, request.deviceName, request.deviceId, request.account,
-                                            request.openId, request.deviceType);
+    // The sharing application has no window: nothing to wait for.
+    auto showWindow = [this, appSource, &request] {
+        return startAllowedWindow(appSource, request.deviceName, request.deviceId, request.account, request.openId,
+                                  request.deviceType);
+    };
+    const int exitCode = !forPcsuite ? 0 : co_await loop_.runBlocking(std::move(showWindow));
     Utils::mPrintlog("[launchService] startAllowedWindow exitCode is " + std::to_string(exitCode));
     if (exitCode != 0) Utils::mPrintlog("[launchService] reject for exitCode " + std::to_string(exitCode));
 
@@ -88,31 +106,37 @@ void LaunchService::launchService(const std::string& ip, const std::string& loca
         Utils::mPrintlog("[launchService] launch service is pcsuite \n");
         if (exitCode != 0 || !Utils::getIsAllowWindow()) {
             Utils::mPrintlog("[launchService] send tcp reject data to phone \n");
-            sendTcp(ConnectTag::REJECT, serviceId::pcsuiteId);
-            return;
+            co_await sendTcp(ConnectTag::REJECT, serviceId::pcsuiteId);
+            co_return;
         }
         Utils::mPrintlog("[launchService] send tcp agree data to phone \n");
-        sendTcp(ConnectTag::AGREE, serviceId::pcsuiteId);
+        co_await sendTcp(ConnectTag::AGREE, serviceId::pcsuiteId);
 
         const long long seqNo = Utils::getNfcLanConnectSeqNo();
         const bool autoConnect = Utils::getThisPhoneAutoConnect();
-        if (sendPhoneInfoToPcsuite(localIp, ip, request.deviceName, kConnectionMode, request.deviceId, seqNo,
-                                   autoConnect, request.account, request.deviceType, request.openId)) {
-            Utils::mPrintlog(
-                "[launchService] success to send phone info to pcsuite, by http request(9199), phone ip is: " + ip);
-        } else {
-            Utils::mPrintlog(
-                "[launchService] failed to send phone info to pcsuite by http request(9199), start pcsuite.exe \n");
-            startPcSuite(ip, request.deviceName, seqNo, kConnectionMode, request.deviceId, autoConnect,
-                         request.account, request.openId, request.deviceType);
-        }
+        auto handOver = [this, &localIp, &ip, &request, seqNo, autoConnect] {
+            if (sendPhoneInfoToPcsuite(localIp, ip, request.deviceName, kConnectionMode, request.deviceId, seqNo,
+                                       autoConnect, request.account, request.deviceType, request.openId)) {
+                Utils::mPrintlog(
+                    "[launchService] success to send phone info to pcsuite, by http request(9199), phone ip is: " + ip);
+            } else {
+                Utils::mPrintlog(
+                    "[launchService] failed to send phone info to pcsuite by http request(9199), start pcsuite.exe \n");
+                startPcSuite(ip, request.deviceName, seqNo, kConnectionMode, request.deviceId, autoConnect,
+                             request.account, request.openId, request.deviceType);
+            }
+        };
+        co_await loop_.runBlocking(std::move(handOver));
     } else {
         Utils::mPrintlog("[launchService] launch service is kesushare \n");
         Utils::mPrintlog("[launchService] send tcp agree data to phone \n");
-        sendTcp(ConnectTag::AGREE, serviceId::shareId);
+        co_await sendTcp(ConnectTag::AGREE, serviceId::shareId);
         Utils::mPrintlog("[launchService] start to launch kesu share allowed window \n");
-        startKesuShareAllowedWindow(request.deviceName, request.deviceId, ip, request.openId,
-                                    Utils::getNfcLanConnectSeqNo(), request.port);
+        const long long seqNo = Utils::getNfcLanConnectSeqNo();
+        auto showShareWindow = [this, &ip, &request, seqNo] {
+            startKesuShareAllowedWindow(request.deviceName, request.deviceId, ip, request.openId, seqNo, request.port);
+        };
+        co_await loop_.runBlocking(std::move(showShareWindow));
     }
     Utils::mPrintlog(
         "[launchService] waiting for pcsuite/kesushare connecting websocket result by [reportNFCConnectResult] \n");

@@ -1,8 +1,12 @@
 // What happens to a phone's accepted connection request: the PC suite's busy check, the
 // allow window and the user's answer, the answer to the phone, and the hand-over to the PC
 // suite (an HTTP message, or starting the PC suite with the phone's details) or to the
-// sharing application's window.
+// sharing application's window. The hand-over is a coroutine on the event loop; what blocks
+// (HTTP to the PC suite, program launches, the wait for the user's answer) runs on the loop's
+// worker pool.
 #pragma once
+
+#include <asio/awaitable.hpp>
 
 #include <atomic>
 #include <functional>
@@ -15,18 +19,22 @@
 
 namespace kesu {
 
+class EventLoop;
+
 class LaunchService {
 public:
     // Sends the PC's answer with `tag` and service id to the phone; true when it left.
-    using SendTcp = std::function<bool(ConnectTag tag, serviceId id)>;
+    using SendTcp = std::function<asio::awaitable<bool>(ConnectTag tag, serviceId id)>;
+
+    explicit LaunchService(EventLoop& loop) : loop_(loop) {}
 
     // The whole hand-over of one request from the phone at `ip`, received on the PC's
-    // address `localIp`. Blocks for the allow window (Config::allowWindowTimeout) and the
-    // exchanges with the PC suite.
-    void launchService(const std::string& ip, const std::string& localIp, AppSource appSource,
-                       const PhoneConnectRequest& request, const SendTcp& sendTcp);
+    // address `localIp`, on the loop. Waits (off the loop) for the allow window
+    // (Config::allowWindowTimeout) and the exchanges with the PC suite.
+    asio::awaitable<void> launchService(std::string ip, std::string localIp, AppSource appSource,
+                                        PhoneConnectRequest request, SendTcp sendTcp);
 
-    // Shows the PC suite's allow window and waits for the user's answer: 0 when agreed, -1
+    // Blocking (worker pool): shows the PC suite's allow window and waits for the user's answer: 0 when agreed, -1
     // when refused, unanswered in time or the window could not be started. The sharing
     // application has no such window: 0 at once.
     int startAllowedWindow(AppSource appSource, const std::string& deviceName, const std::string& deviceId,
@@ -66,6 +74,8 @@ public:
     void resume();
 
 private:
+    EventLoop& loop_;
+
     // The receive folders handed to the sharing window: the account's current one and the
     // one before it.
     std::pair<std::string, std::string> receiveFolders();

@@ -1,10 +1,15 @@
 #include "connect/Pcuitinterface.h"
 
+#include <asio/co_spawn.hpp>
+
+#include <future>
+
 #include "connect/ConnectCodes.h"
 #include "connect/ConnectMessage.h"
 #include "connect/SocketClient.h"
 #include "connect/Step.h"
 #include "core/Config.h"
+#include "core/EventLoop.h"
 #include "core/Json.h"
 #include "core/Utils.h"
 #include "discovery/SsdpDeviceManager.h"
@@ -12,26 +17,24 @@
 namespace kesu {
 
 CancelFlag& CancelFlag::operator=(bool cancel) {
-    std::shared_ptr<SocketClient> running;
-    {
-        std::lock_guard<std::mutex> lock(mutex_);
-        flag_.store(cancel);
-        if (cancel) running = running_;
-    }
+    std::lock_guard<std::mutex> lock(mutex_);
+    flag_.store(cancel);
     // Shutting the link wakes the attempt wherever it waits (connect, send or answer).
-    if (running) running->disConnectServer();
+    if (cancel && running_ && loop_) loop_->post([running = running_] { running->disConnectServer(); });
     return *this;
 }
 
-bool CancelFlag::attach(std::shared_ptr<SocketClient> client) {
+bool CancelFlag::attach(std::shared_ptr<SocketClient> client, EventLoop& loop) {
     std::lock_guard<std::mutex> lock(mutex_);
     running_ = std::move(client);
+    loop_ = &loop;
     return flag_.load();
 }
 
 void CancelFlag::detach() {
     std::lock_guard<std::mutex> lock(mutex_);
     running_.reset();
+    loop_ = nullptr;
 }
 
 CancelFlag& SSDPcancel() {
@@ -40,6 +43,8 @@ CancelFlag& SSDPcancel() {
 }
 
 namespace {
+
+std::atomic<EventLoop*> attemptLoop{nullptr};
 
 // Held for the whole of one attempt.
 std::mutex& attemptMutex() {
@@ -57,6 +62,8 @@ std::string busyReply() {
 }
 
 }  // namespace
+
+void Pcuitinterface::setLoop(EventLoop* loop) { attemptLoop.store(loop); }
 
 std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
     std::unique_lock<std::mutex> oneAttempt(attemptMutex(), std::try_to_lock);
@@ -101,9 +108,18 @@ std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
     struct AttachGuard {
         ~AttachGuard() { SSDPcancel().detach(); }
     };
-    ClientWorkAct work;
+    EventLoop* const loop = attemptLoop.load();
+    if (loop == nullptr || !loop->running()) {
+        Utils::mPrintlog("[ActiveConnect] the service's event loop is not running, no link can be made \n");
+        steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::OK) + step.getConnectCode(step.WLAN_CONNECT_SERVER) +
+                 step.getConnectResult(step.WLAN_CONNECT_SERVER, Result::FAILED);
+        return finish(rawValue(ErrorCode::TIMEOUT), "error_message",
+                      "[SSDP search] connect timeout or phone wake up pcsuite failed.");
+    }
+    // Shared with the exchange on the loop, which may outlive this call when the loop stalls.
+    const auto work = std::make_shared<ClientWorkAct>(std::make_shared<SocketClient>(loop->executor()));
     AttachGuard attached;
-    if (SSDPcancel().attach(work.ClientShared)) {
+    if (SSDPcancel().attach(work->ClientShared, *loop)) {
         Utils::mPrintlog("[ActiveConnect] cancel before initTcp \n");
         steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::CANCEL);
         return finish(rawValue(ErrorCode::CANCEL), "errir_message", "CANCEL");
@@ -112,8 +128,25 @@ std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
 
     const std::string& ip = device->ip.front();
     Utils::mPrintlog("[ActiveConnect] Enter the accept event waiting! \n");
-    const auto outcome = work.ClientReqServer(static_cast<std::uint16_t>(config.phoneTcpPort), ip, deadline,
-                                              [] { return SSDPcancel().load(); });
+    // The exchange runs on the loop; this (control API) thread waits for its outcome. The
+    // deadline bounds the exchange itself, the margin only a loop that ends meanwhile.
+    auto result = std::make_shared<std::promise<ClientWorkAct::Outcome>>();
+    auto future = result->get_future();
+    asio::co_spawn(
+        loop->executor(),
+        work->ClientReqServer(static_cast<std::uint16_t>(config.phoneTcpPort), ip, deadline,
+                              [] { return SSDPcancel().load(); }),
+        [result, work](std::exception_ptr failure, ClientWorkAct::Outcome outcome) {
+            if (failure) outcome = ClientWorkAct::Outcome::NoAnswer;
+            result->set_value(outcome);
+        });
+    auto outcome = ClientWorkAct::Outcome::Stopped;
+    try {
+        if (future.wait_until(deadline + std::chrono::seconds(5)) == std::future_status::ready) outcome = future.get();
+    } catch (const std::future_error&) {
+        // The loop ended with the exchange unfinished.
+    }
+    const auto disconnect = [&] { loop->call([work] { work->ClientDisConnServer(); }); };
     const bool cancelled = SSDPcancel().load();
     Utils::mPrintlog(outcome == ClientWorkAct::Outcome::Answered || cancelled
                          ? "[ActiveConnect]accept event success \n"
@@ -123,7 +156,7 @@ std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
     if (outcome == ClientWorkAct::Outcome::ConnectFailed && !cancelled) {
         // The phone's port could not be reached: no answer can come, and the connect step
         // is reported as failed.
-        work.ClientDisConnServer();
+        disconnect();
         steps += step.getConnectResult(step.WLAN_CONNECT_SERVER, Result::FAILED);
         Utils::mPrintlog("[ActiveConnect] return_code_ " + std::to_string(rawValue(ConnectTag::TIMEOUT)) +
                          " , timeout \n");
@@ -134,16 +167,16 @@ std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
 
     if (cancelled) {
         Utils::mPrintlog("[ActiveConnect] cancel before return code \n");
-        work.ClientDisConnServer();
+        disconnect();
         steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::CANCEL);
         return finish(rawValue(ErrorCode::CANCEL), "errir_message", "CANCEL");
     }
 
-    const std::string text = work.ClientShared->ServerMessageReceive();
+    const std::string text = work->ClientShared->ServerMessageReceive();
     Utils::mPrintlog("[TCP Positive Conn] " + text);
     const ConnectTag answer = classifyPhoneAnswer(text);
     const std::string code = std::to_string(rawValue(answer));
-    work.ClientDisConnServer();
+    disconnect();
 
     switch (answer) {
     case ConnectTag::PHONEAGREE:

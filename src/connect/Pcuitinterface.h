@@ -8,6 +8,7 @@
 
 namespace kesu {
 
+class EventLoop;
 class SocketClient;
 
 // The cancel request of the running PC-initiated connection. Setting it to true also ends
@@ -21,21 +22,27 @@ public:
 
 private:
     friend class Pcuitinterface;
-    // Makes `client` the running attempt's link; returns the flag as it is now.
-    bool attach(std::shared_ptr<SocketClient> client);
+    // Makes `client`, on `loop`, the running attempt's link; returns the flag as it is now.
+    bool attach(std::shared_ptr<SocketClient> client, EventLoop& loop);
     void detach();
 
     std::atomic<bool> flag_{false};
     std::mutex mutex_;
     std::shared_ptr<SocketClient> running_;
+    EventLoop* loop_ = nullptr;
 };
 
 CancelFlag& SSDPcancel();
 
 class Pcuitinterface {
 public:
+    // The event loop the attempts' links run on; the service sets it when it starts and
+    // clears it (nullptr) when it stops. Without one an attempt fails at the connect step.
+    static void setLoop(EventLoop* loop);
+
     // The whole attempt; returns the compact connection reply {"error", "error_message",
-    // "connection_steps"(, "data")(, "errir_message")}. Blocks until the phone answered, the
+    // "connection_steps"(, "data")(, "errir_message")}. The exchange with the phone runs on
+    // the loop; the calling thread (never the loop's) blocks until the phone answered, the
     // attempt failed or was cancelled, or Config::activeConnectTimeout passed. One attempt
     // runs at a time: a call while another runs gets the busy reply.
     std::string ActiveConnect(const std::string& stringId);

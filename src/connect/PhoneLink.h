@@ -1,12 +1,19 @@
-// One TCP link with a phone for a single request and its answer: connect (or adopt an
-// accepted descriptor), write a frame, read the next whole frame. Every wait has a deadline,
-// and shut() from any thread ends every wait on the link at once, also one not yet begun.
+// One TCP link with a phone on the service's event loop: connect (or adopt an accepted
+// socket), write a frame, read the next whole frame. Each step is a coroutine with an optional
+// deadline (a timer raced against the socket operation); a link waiting without a deadline
+// costs no wake-ups. Every call, shut() included, is made on the loop: another thread posts
+// it there. shut() ends every wait on the link at once, also one not yet begun.
 #pragma once
 
+#include <asio/awaitable.hpp>
+#include <asio/ip/tcp.hpp>
+#include <asio/steady_timer.hpp>
+
+#include <array>
 #include <atomic>
 #include <chrono>
 #include <cstdint>
-#include <mutex>
+#include <optional>
 #include <string>
 
 #include "connect/ISocketBase.h"
@@ -17,21 +24,22 @@ namespace kesu {
 class PhoneLink {
 public:
     using Clock = std::chrono::steady_clock;
+    // A wait without a deadline (a held link waiting for the phone's next message).
+    static constexpr Clock::time_point kNoDeadline = Clock::time_point::max();
 
     // A link not yet connected; connect() opens it.
-    PhoneLink();
-    // Takes over an accepted, connected descriptor.
-    explicit PhoneLink(int connectedFd);
-    ~PhoneLink();
+    explicit PhoneLink(const asio::any_io_executor& executor);
+    // Takes over an accepted, connected socket.
+    explicit PhoneLink(asio::ip::tcp::socket socket);
     PhoneLink(const PhoneLink&) = delete;
     PhoneLink& operator=(const PhoneLink&) = delete;
 
     // Connects to ip:port (a numeric IPv4 or IPv6 address) before the deadline. False with
     // `error` filled when refused, unreachable, timed out or shut meanwhile.
-    bool connect(const std::string& ip, std::uint16_t port, Clock::time_point deadline, std::string& error);
+    asio::awaitable<bool> connect(std::string ip, std::uint16_t port, Clock::time_point deadline, std::string& error);
     // Writes all of `data` before the deadline. A write the deadline cuts short would leave half
     // a frame on the wire for the peer to misread, so the link is shut then.
-    bool writeAll(const Bytes& data, Clock::time_point deadline, std::string& error);
+    asio::awaitable<bool> writeAll(const Bytes& data, Clock::time_point deadline, std::string& error);
 
     enum class Read {
         Frame,     // a whole frame (header included) was moved into `frame`
@@ -40,33 +48,34 @@ public:
         Shut,      // shut() was called
     };
     // Waits for the next whole phone frame. Bytes that cannot start a frame are dropped (with
-    // a log line); the buffer is bounded by Config::phoneFrameMaxBody. Frames that arrived
-    // before the peer closed are handed out before Closed.
-    Read readFrame(Bytes& frame, Clock::time_point deadline);
-    // Why readFrame gave Closed: "" for the peer's orderly close, else the error. Reading thread only.
+    // a log line); a frame is handed out only once the body its length announces has arrived,
+    // and one announcing more than Config::phoneFrameMaxBody is dropped. Frames that arrived
+    // before the peer closed are handed out before Closed. One reader at a time.
+    asio::awaitable<Read> readFrame(Bytes& frame, Clock::time_point deadline);
+    // Why readFrame gave Closed: "" for the peer's orderly close, else the error.
     const std::string& readError() const { return readError_; }
 
-    // Ends the link for every user; safe from any thread, repeated calls do nothing. The
-    // descriptors are closed by the destructor only, so no waiting thread ever polls a
-    // reused descriptor number.
+    // Ends the link; repeated calls do nothing.
     void shut();
     bool isShut() const { return shut_.load(); }
     bool isConnected() const { return connected_.load(); }
 
     // Both ends of a connected link ("" and 0 before).
-    std::string peerAddress() const;
-    int peerPort() const;
-    std::string localAddress() const;
-    int localPort() const;
+    const std::string& peerAddress() const { return peerAddress_; }
+    int peerPort() const { return peerPort_; }
+    const std::string& localAddress() const { return localAddress_; }
+    int localPort() const { return localPort_; }
 
 private:
-    enum class Wait { Ready, Woken, TimedOut };
-    Wait waitFor(short events, Clock::time_point deadline);
-    void readEndpoints();
+    void adopt();
+    // `operation` raced against `timer` set to `deadline`; nullopt when the deadline came first.
+    template <class T>
+    asio::awaitable<std::optional<T>> beforeDeadline(asio::awaitable<T> operation, asio::steady_timer& timer,
+                                                     Clock::time_point deadline);
 
-    mutable std::mutex mutex_;  // guards fd_ creation against shut(), and the endpoint texts
-    int fd_ = -1;
-    const int wakeFd_;
+    asio::ip::tcp::socket socket_;
+    asio::steady_timer readTimer_;
+    asio::steady_timer writeTimer_;  // also the connect's
     std::atomic<bool> shut_{false};
     std::atomic<bool> connected_{false};
     std::string peerAddress_;
@@ -74,10 +83,10 @@ private:
     std::string localAddress_;
     int localPort_ = 0;
 
-    // Used by the one reading thread only.
     FrameCutter cutter_;
     bool peerClosed_ = false;
     std::string readError_;
+    std::array<std::uint8_t, 4096> chunk_{};
 };
 
 }  // namespace kesu

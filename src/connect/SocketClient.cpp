@@ -7,15 +7,16 @@
 
 namespace kesu {
 
-bool SocketClient::connect(std::uint16_t ConnectServerPort, const std::string& host, Clock::time_point deadline) {
+asio::awaitable<bool> SocketClient::connect(std::uint16_t ConnectServerPort, std::string host,
+                                            Clock::time_point deadline) {
     std::string error;
-    if (!link_.connect(host, ConnectServerPort, deadline, error)) {
+    if (!co_await link_.connect(std::move(host), ConnectServerPort, deadline, error)) {
         Utils::mPrintlog("[TCP Positive Conn]Error occur during connect as: " + error);
-        return false;
+        co_return false;
     }
     Utils::mPrintlog("[TCP Positive Conn] success, host: " + link_.localAddress() +
                      ", port: " + std::to_string(link_.localPort()));
-    return true;
+    co_return true;
 }
 
 void SocketClient::disConnectServer() {
@@ -24,27 +25,27 @@ void SocketClient::disConnectServer() {
     if (wasConnected) Utils::mPrintlog("[TCP Positive Conn] An unknown error, Execute down! disconenct now \n");
 }
 
-bool SocketClient::C2SsendMessage(const Bytes& message, Clock::time_point deadline) {
+asio::awaitable<bool> SocketClient::C2SsendMessage(const Bytes& message, Clock::time_point deadline) {
     std::string error;
-    if (!link_.writeAll(message, deadline, error)) {
+    if (!co_await link_.writeAll(message, deadline, error)) {
         Utils::mPrintlog("[TCP Positive Conn] An error, Execute down! error code: " + error + ", disconenct now \n");
-        return false;
+        co_return false;
     }
     Utils::mPrintlog("[TCP Positive Conn] Client write tag 0 done \n");
-    return true;
+    co_return true;
 }
 
-bool SocketClient::CFrSpullMessage(Clock::time_point deadline) {
+asio::awaitable<bool> SocketClient::CFrSpullMessage(Clock::time_point deadline) {
     Bytes frame;
-    switch (link_.readFrame(frame, deadline)) {
+    switch (co_await link_.readFrame(frame, deadline)) {
     case PhoneLink::Read::Frame:
         break;
     case PhoneLink::Read::Closed:
         Utils::mPrintlog("[TCP Positive Conn] An error, Execute down! error code: closed by the phone, disconenct now \n");
-        return false;
+        co_return false;
     case PhoneLink::Read::TimedOut:
     case PhoneLink::Read::Shut:
-        return false;
+        co_return false;
     }
     Utils::mPrintlog("[TCP Positive Conn] Client read tag 0 done \n");
     const auto text = phoneAnswerText(frame);
@@ -52,11 +53,11 @@ bool SocketClient::CFrSpullMessage(Clock::time_point deadline) {
     if (!text) {
         serverMessageReceive_ = "error parse";
         Utils::mPrintlog("[TCP Positive Conn] data parser result failed \n");
-        return true;
+        co_return true;
     }
     serverMessageReceive_ = *text;
     Utils::mPrintlog("[TCP Positive Conn] Receive data is: " + *text);
-    return true;
+    co_return true;
 }
 
 std::string SocketClient::ServerMessageReceive() const {
@@ -69,30 +70,28 @@ void SocketClient::clearServerMessageReceive() {
     serverMessageReceive_.clear();
 }
 
-ClientWorkAct::ClientWorkAct(std::shared_ptr<SocketClient> client) : ClientShared(std::move(client)) {}
-
-ClientWorkAct::Outcome ClientWorkAct::ClientReqServer(std::uint16_t Port, const std::string& ip,
-                                                      Clock::time_point deadline,
-                                                      const std::function<bool()>& stopRequested) {
+asio::awaitable<ClientWorkAct::Outcome> ClientWorkAct::ClientReqServer(std::uint16_t Port, std::string ip,
+                                                                       Clock::time_point deadline,
+                                                                       std::function<bool()> stopRequested) {
     auto stopped = [&] { return ClientShared->isDisconnected() || (stopRequested && stopRequested()); };
-    if (!ClientShared->connect(Port, ip, deadline)) {
+    if (!co_await ClientShared->connect(Port, std::move(ip), deadline)) {
         Utils::setWlanConnState(false);
-        if (stopped()) return Outcome::Stopped;
+        if (stopped()) co_return Outcome::Stopped;
         Utils::mPrintlog("[ClientReqServer] connect phone tcp server failed ...");
-        return Outcome::ConnectFailed;
+        co_return Outcome::ConnectFailed;
     }
     Utils::setWlanConnState(true);
-    if (stopped()) return Outcome::Stopped;
+    if (stopped()) co_return Outcome::Stopped;
 
     const std::string vaildJson = json::compact(connectRequestBody());
     Utils::mPrintlog("[ClientReqServer] Send connect message to phone, vaildJson count: " +
                      std::to_string(vaildJson.size()) + ", vaildJson: " + vaildJson + " \n");
-    const bool sent = ClientShared->C2SsendMessage(buildPhoneFrame(vaildJson), deadline);
-    if (stopped()) return Outcome::Stopped;
-    if (!sent) return Outcome::NoAnswer;
+    const bool sent = co_await ClientShared->C2SsendMessage(buildPhoneFrame(vaildJson), deadline);
+    if (stopped()) co_return Outcome::Stopped;
+    if (!sent) co_return Outcome::NoAnswer;
 
-    if (ClientShared->CFrSpullMessage(deadline)) return Outcome::Answered;
-    return stopped() ? Outcome::Stopped : Outcome::NoAnswer;
+    if (co_await ClientShared->CFrSpullMessage(deadline)) co_return Outcome::Answered;
+    co_return stopped() ? Outcome::Stopped : Outcome::NoAnswer;
 }
 
 void ClientWorkAct::ClientDisConnServer() {

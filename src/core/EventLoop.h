@@ -3,10 +3,13 @@
 // SQLite reads) and posts the result back to the loop.
 #pragma once
 
+#include <asio/async_result.hpp>
+#include <asio/awaitable.hpp>
 #include <asio/executor_work_guard.hpp>
 #include <asio/io_context.hpp>
 #include <asio/post.hpp>
 #include <asio/thread_pool.hpp>
+#include <asio/use_awaitable.hpp>
 
 #include <atomic>
 #include <chrono>
@@ -61,6 +64,24 @@ public:
                 asio::post(io_, [done = std::move(done), result = work()]() mutable { done(std::move(result)); });
             }
         });
+    }
+    // The awaitable form of offload for a coroutine on the loop: `co_await loop.runBlocking(fn)`
+    // runs `fn` on the worker pool and resumes the coroutine on the loop with its result. When
+    // the loop ends meanwhile the coroutine is never resumed (its frame is destroyed).
+    // Pass a named function object (std::move(fn)), not a lambda written in the co_await
+    // expression: g++ 12 destroys such temporaries of a co_await operand twice.
+    template <class Work>
+    auto runBlocking(Work&& work) {
+        using W = std::decay_t<Work>;
+        using R = std::invoke_result_t<W&>;
+        auto initiate = [this](auto handler, W work) { offload(std::move(work), std::move(handler)); };
+        if constexpr (std::is_void_v<R>) {
+            return asio::async_initiate<const asio::use_awaitable_t<>&, void()>(initiate, asio::use_awaitable,
+                                                                                W(std::forward<Work>(work)));
+        } else {
+            return asio::async_initiate<const asio::use_awaitable_t<>&, void(R)>(initiate, asio::use_awaitable,
+                                                                                 W(std::forward<Work>(work)));
+        }
     }
     // Runs `work` on the worker pool (fire and forget).
     template <class Work>

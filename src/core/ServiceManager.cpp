@@ -1,5 +1,6 @@
 #include "core/ServiceManager.h"
 
+#include "connect/Pcuitinterface.h"
 #include "connect/SocketServer.h"
 #include "core/Config.h"
 #include "core/EventLoop.h"
@@ -26,8 +27,10 @@ void ServiceManager::start() {
     serviceWorker_ = std::make_unique<ServiceWorker>(loop_);
     serviceWorker_->start();
 
-    // The server for phone-initiated connections.
-    ServerWorkAct().ServerAccept();
+    // The server for phone-initiated connections, and the PC-initiated ones, on the loop.
+    Pcuitinterface::setLoop(&loop_);
+    phoneServer_ = std::make_unique<SocketServer>(loop_);
+    ServerWorkAct(*phoneServer_).ServerAccept();
 
     // LAN device list: a first report now, then on every new or changed device and on expiry.
     wlanReportDevices_ = std::make_shared<WlanReportDevices>();
@@ -49,7 +52,9 @@ void ServiceManager::stop() {
     started_ = false;
     if (serviceWorker_) serviceWorker_->stop();  // the network events' publisher goes first
     serviceWorker_.reset();
-    SocketServer::singleton().stop();
+    if (phoneServer_) phoneServer_->stop();
+    phoneServer_.reset();
+    Pcuitinterface::setLoop(nullptr);
     eventDetected_.reset();
     EventPublisher::instance().clearObservers();
     for (const auto& subscriber : subscribers_) subscriber->waitIdle(std::chrono::seconds(5));

@@ -7,15 +7,27 @@
 
 #include "connect/Pcuitinterface.h"
 #include "discovery/SsdpDeviceManager.h"
+#include "phonesim/PhoneSimulator.h"
 #include "unit/UnitHelpers.h"
-#include "unit/connect/PhoneSim.h"
+#include "unit/connect/ConnectFixture.h"
 
 namespace kesu {
 namespace {
 
 using namespace std::chrono_literals;
-using test::SimPhone;
 using test::control;
+using Phone = phonesim::Listener;
+
+// A phone on loopback that answers with `body` (silent or hanging up when told).
+Phone::Options answering(phonesim::Answer answer, std::string body = "") {
+    Phone::Options options;
+    options.answer = answer;
+    options.answerBody = std::move(body);
+    return options;
+}
+constexpr auto kAnswer = phonesim::Answer::Accept;
+constexpr auto kSilent = phonesim::Answer::Silent;
+constexpr auto kHangUp = phonesim::Answer::HangUp;
 
 // Far beyond what any of these exchanges needs; a wait that ends well before it ended by its
 // event.
@@ -26,12 +38,15 @@ class ActiveConnectTest : public test::PcIdentityTest {
 protected:
     void SetUp() override {
         PcIdentityTest::SetUp();
+        loop.start();
+        Pcuitinterface::setLoop(&loop);
         clearTable();
         env.config().activeConnectTimeout = kLong;
     }
     void TearDown() override {
         clearTable();
         SSDPcancel() = false;
+        Pcuitinterface::setLoop(nullptr);
         PcIdentityTest::TearDown();
     }
     static void clearTable() { SsdpDeviceManager::instance().ssdpDeviceMap.clear(); }
@@ -44,7 +59,7 @@ protected:
         SsdpDeviceManager::instance().ssdpDeviceMap.insert(id, device);
     }
     // A phone on loopback known to the table as "d1".
-    void usePhone(const SimPhone& phone, const std::string& type = "phone") {
+    void usePhone(const Phone& phone, const std::string& type = "phone") {
         env.config().phoneTcpPort = phone.port();
         addDevice("d1", {"127.0.0.1"}, type);
     }
@@ -52,7 +67,7 @@ protected:
 };
 
 TEST_F(ActiveConnectTest, PhoneAgreesWithTheRequestOnTheWire) {
-    SimPhone phone(SimPhone::Mode::Answer, R"({"bytes":[1],"deviceName":"phone"})");
+    Phone phone(answering(kAnswer, R"({"bytes":[1],"deviceName":"phone"})"));
     usePhone(phone, "pad");
     EXPECT_EQ(connect("d1"), (Json{{"error", 0},
                                    {"error_message", ""},
@@ -80,7 +95,7 @@ TEST_F(ActiveConnectTest, PhoneRefusesIsBusyOrSaysSomethingElse) {
          "_WI:0_WF:0_TF:0_WO:-1"},  // not UTF-8: nothing to classify
     };
     for (const Case& c : cases) {
-        SimPhone phone(SimPhone::Mode::Answer, c.answer);
+        Phone phone(answering(kAnswer, c.answer));
         usePhone(phone);
         const Json reply = connect("d1");
         EXPECT_EQ(reply, (Json{{"error", c.error}, {"error_message", c.message}, {"connection_steps", c.steps}}))
@@ -95,7 +110,7 @@ TEST_F(ActiveConnectTest, SilenceHangUpAndRefusedConnectAreTimeouts) {
                           {"connection_steps", "_WI:0_WF:0_TF:0_WO:-1"}};
     {
         env.config().activeConnectTimeout = 300ms;
-        SimPhone phone(SimPhone::Mode::Silent);
+        Phone phone(answering(kSilent));
         usePhone(phone);
         EXPECT_EQ(connect("d1"), timeout);
         EXPECT_TRUE(phone.pcClosed(kWellBeforeLong));
@@ -103,7 +118,7 @@ TEST_F(ActiveConnectTest, SilenceHangUpAndRefusedConnectAreTimeouts) {
     }
     {
         // The phone hangs up without answering: no answer can come any more.
-        SimPhone phone(SimPhone::Mode::HangUp);
+        Phone phone(answering(kHangUp));
         usePhone(phone);
         EXPECT_EQ(connect("d1"), timeout);
     }
@@ -130,7 +145,7 @@ TEST_F(ActiveConnectTest, UnknownDeviceAndDeviceWithoutAddress) {
 }
 
 TEST_F(ActiveConnectTest, CancelEndsTheWaitAtOnce) {
-    SimPhone phone(SimPhone::Mode::Silent);
+    Phone phone(answering(kSilent));
     usePhone(phone);
     auto attempt = std::async(std::launch::async, [] { return connect("d1"); });
     ASSERT_TRUE(phone.request(kWellBeforeLong));  // the attempt now waits for the answer
@@ -144,13 +159,13 @@ TEST_F(ActiveConnectTest, CancelEndsTheWaitAtOnce) {
 
     // A cancel with no attempt running changes nothing for the next attempt.
     control("cancelSSDPConnect");
-    SimPhone next(SimPhone::Mode::Answer, R"({"bytes":[1]})");
+    Phone next(answering(kAnswer));
     usePhone(next);
     EXPECT_EQ(connect("d1")["error"], 0);
 }
 
 TEST_F(ActiveConnectTest, SecondRequestWhileOneWaitsIsBusy) {
-    SimPhone phone(SimPhone::Mode::Silent);
+    Phone phone(answering(kSilent));
     usePhone(phone);
     auto first = std::async(std::launch::async, [] { return control("connectSSDP", {"d1"}); });
     ASSERT_TRUE(phone.request(kWellBeforeLong));

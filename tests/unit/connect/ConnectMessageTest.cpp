@@ -4,7 +4,7 @@
 
 #include <gtest/gtest.h>
 
-#include "unit/connect/PhoneSim.h"
+#include "unit/connect/ConnectFixture.h"
 
 namespace kesu {
 namespace {

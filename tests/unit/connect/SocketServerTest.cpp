@@ -10,19 +10,20 @@
 #include <future>
 
 #include "connect/AllowWindow.h"
-#include "connect/TcpSocketBase.h"
+#include "phonesim/PhoneSimulator.h"
 #include "support/StubPcSuite.h"
 #include "unit/UnitHelpers.h"
-#include "unit/connect/PhoneSim.h"
+#include "unit/connect/ConnectFixture.h"
 
 namespace kesu {
 namespace {
 
 using namespace std::chrono_literals;
 using test::control;
+using Phone = phonesim::Link;
 
 constexpr auto kLong = 120s;
-constexpr double kWait = 60.0;  // seconds a test phone waits for an answer
+constexpr auto kWait = 60s;  // how long a test phone waits for an answer
 
 void drainAllowAnswers() {
     while (hAllowSemaphore().try_acquire()) {
@@ -33,6 +34,7 @@ class PhoneServer : public test::PcIdentityTest {
 protected:
     void SetUp() override {
         PcIdentityTest::SetUp();
+        loop.start();
         drainAllowAnswers();
         dataInstance().set(&databaseParam::storageDir, "/data/recv");
         Config& config = env.config();
@@ -65,37 +67,32 @@ protected:
                 {"extra_info", extra.dump()}};
     }
     // A test phone with its link to the server.
-    std::unique_ptr<TcpSocketBase> dial() {
+    std::unique_ptr<Phone> dial() {
         startServer();
-        auto phone = std::make_unique<TcpSocketBase>();
-        EXPECT_TRUE(phone->initial(static_cast<std::uint16_t>(server.port()), "127.0.0.1", 10));
+        std::string error;
+        auto phone = Phone::dial("127.0.0.1", server.port(), error);
+        EXPECT_TRUE(phone) << error;
         return phone;
     }
-    std::unique_ptr<TcpSocketBase> send(const Bytes& frame) {
+    std::unique_ptr<Phone> send(const Bytes& frame) {
         auto phone = dial();
-        EXPECT_TRUE(phone->sendMsg(10, frame));
+        EXPECT_TRUE(phone->send(frame));
         return phone;
     }
-    std::unique_ptr<TcpSocketBase> send(const Json& body) { return send(buildPhoneFrame(body.dump())); }
+    std::unique_ptr<Phone> send(const Json& body) { return send(buildPhoneFrame(body.dump())); }
     // The server's answer on the link (its raw body in `raw`); null when none came.
-    static Json answer(TcpSocketBase& phone, std::string* raw = nullptr) {
-        Bytes frame;
-        int error = 0;
-        if (!phone.recvMsg(kWait, frame, error)) return Json();
-        const std::string body = phoneFrameBody(frame);
+    static Json answer(Phone& phone, std::string* raw = nullptr) {
+        std::string body;
+        if (phone.read(body, kWait) != Phone::Got::Frame) return Json();
         if (raw) *raw = body;
         return Json::parse(body);
     }
     // True when the server closed the link (with nothing more to read).
-    static bool closedByServer(TcpSocketBase& phone) {
-        Bytes frame;
-        int error = 0;
-        return !phone.recvMsg(kWait, frame, error) && error == -1;
-    }
+    static bool closedByServer(Phone& phone) { return phone.closedByPeer(kWait); }
 
     test::StubPcSuite pcsuite;
     std::unique_ptr<test::LaunchRecorder> window;
-    SocketServer server;
+    SocketServer server{loop};
 };
 
 TEST_F(PhoneServer, UserAgreesAndThePcSuiteGetsThePhone) {
@@ -206,7 +203,10 @@ TEST_F(PhoneServer, SharingRequestsSkipTheAllowWindow) {
 
 TEST_F(PhoneServer, BadInputIsDroppedAndEveryLinkIsClosed) {
     env.config().phoneLinkReadTimeout = 300ms;
+    env.config().phoneFrameMaxBody = 1024;
+    Bytes oversized = buildPhoneFrame(std::string(2000, ' '));
     const std::vector<Bytes> frames = {
+        oversized,                                                 // a body above the limit
         buildPhoneFrame(""),                                       // 14 bytes: no body
         buildPhoneFrame("{\"bytes\":[0],\"x\":\"\xff\xfe\"}"),     // not UTF-8
         buildPhoneFrame("[0]"),                                    // not an object
@@ -256,7 +256,7 @@ TEST_F(PhoneServer, LinksAreBoundedAndStopEndsThem) {
 TEST_F(PhoneServer, PortInUseIsReported) {
     startServer();
     env.config().phoneServerPort = server.port();
-    SocketServer second;
+    SocketServer second{loop};
     EXPECT_FALSE(second.ConnectStatusGet());
     EXPECT_EQ(second.port(), 0);
 }

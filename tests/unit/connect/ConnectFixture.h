@@ -1,7 +1,6 @@
-// Test peers of the phone connections: the PC's identity as phones see it (a fixture), a
-// simulated phone that listens on a loopback port and speaks the frame protocol (answers,
-// stays silent or hangs up), and a stand-in for a launched program that reports its
-// arguments back to the test over loopback.
+// What the phone connection tests share: the PC's identity as phones see it (a fixture), the
+// service's event loop, and a stand-in for a launched program that reports its arguments
+// back to the test over loopback. The phones themselves are tools/phonesim.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -9,21 +8,19 @@
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <poll.h>
-#include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <filesystem>
 #include <fstream>
-#include <future>
 #include <optional>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "account/DataInstance.h"
 #include "connect/PhoneFrame.h"
+#include "core/EventLoop.h"
 #include "core/Json.h"
 #include "core/Utils.h"
 #include "platform/fake/FakePlatform.h"
@@ -68,6 +65,7 @@ protected:
 
     HermeticEnv env;
     ScopedFakePlatform fake;
+    EventLoop loop;  // started by the tests that need it; outlives what runs on it
 };
 
 // A listening socket on 127.0.0.1, an ephemeral port.
@@ -92,88 +90,6 @@ inline bool readable(int fd, int stopFd, std::chrono::milliseconds timeout) {
     if (stopFd >= 0 && fds[1].revents != 0) return false;
     return fds[0].revents != 0;
 }
-
-// One phone: accepts one link, reads the PC's request frame, then behaves as told.
-class SimPhone {
-public:
-    enum class Mode {
-        Answer,  // sends `answerBody` in a frame, then waits for the PC to close
-        Silent,  // says nothing and waits for the PC to close
-        HangUp,  // closes the link as soon as the request arrived
-    };
-
-    explicit SimPhone(Mode mode, std::string answerBody = "")
-        : mode_(mode), answer_(std::move(answerBody)), stopFd_(::eventfd(0, EFD_CLOEXEC)) {
-        listenFd_ = listenLoopback(port_);
-        thread_ = std::thread([this] { run(); });
-    }
-    ~SimPhone() {
-        const std::uint64_t one = 1;
-        [[maybe_unused]] auto n = ::write(stopFd_, &one, sizeof one);
-        thread_.join();
-        ::close(listenFd_);
-        ::close(stopFd_);
-    }
-
-    int port() const { return port_; }
-    // The body of the PC's request; nullopt when none arrived in time.
-    std::optional<std::string> request(std::chrono::milliseconds timeout) {
-        if (requestFuture_.wait_for(timeout) != std::future_status::ready) return std::nullopt;
-        return requestFuture_.get();
-    }
-    // True once the PC closed the link after its request.
-    bool pcClosed(std::chrono::milliseconds timeout) {
-        return closedFuture_.wait_for(timeout) == std::future_status::ready && closedFuture_.get();
-    }
-
-private:
-    void run() {
-        bool closedByPc = false;
-        bool requestSent = false;
-        if (readable(listenFd_, stopFd_, std::chrono::minutes(5))) {
-            const int link = ::accept4(listenFd_, nullptr, nullptr, SOCK_CLOEXEC);
-            FrameCutter cutter(1 << 20);
-            std::optional<Bytes> frame;
-            char buffer[4096];
-            while (!frame && readable(link, stopFd_, std::chrono::minutes(5))) {
-                const ssize_t n = ::recv(link, buffer, sizeof buffer, 0);
-                if (n <= 0) break;
-                cutter.feed(std::string_view(buffer, static_cast<std::size_t>(n)));
-                frame = cutter.next();
-            }
-            if (frame) {
-                requestPromise_.set_value(phoneFrameBody(*frame));
-                requestSent = true;
-                if (mode_ == Mode::Answer) {
-                    const Bytes answer = buildPhoneFrame(answer_);
-                    [[maybe_unused]] auto sent = ::send(link, answer.data(), answer.size(), MSG_NOSIGNAL);
-                }
-                if (mode_ != Mode::HangUp) {
-                    while (readable(link, stopFd_, std::chrono::minutes(5))) {
-                        if (::recv(link, buffer, sizeof buffer, 0) <= 0) {
-                            closedByPc = true;
-                            break;
-                        }
-                    }
-                }
-            }
-            ::close(link);
-        }
-        if (!requestSent) requestPromise_.set_value(std::string());
-        closedPromise_.set_value(closedByPc);
-    }
-
-    Mode mode_;
-    std::string answer_;
-    int stopFd_;
-    int listenFd_ = -1;
-    int port_ = 0;
-    std::promise<std::string> requestPromise_;
-    std::future<std::string> requestFuture_ = requestPromise_.get_future();
-    std::promise<bool> closedPromise_;
-    std::future<bool> closedFuture_ = closedPromise_.get_future();
-    std::thread thread_;
-};
 
 // A program at `path` (an executable script written there) that sends its arguments, each
 // ended by a NUL byte, to this recorder over loopback and exits. A start that nobody waits
