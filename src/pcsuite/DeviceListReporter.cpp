@@ -41,7 +41,7 @@ std::string listText(const Range& items, ToJson toJson) {
 // ---- DeviceListReporter ---------------------------------------------------------------------
 
 // The scheduling state, shared with the timers and the pool work so that none of them
-// outlives what it touches. Everything but `timer` is guarded by `mutex`.
+// outlives what it touches. Guarded by `mutex`; the timer objects are used on the loop only.
 struct DeviceListReporter::Core : std::enable_shared_from_this<Core> {
     using Steady = std::chrono::steady_clock;
 
@@ -77,13 +77,19 @@ struct DeviceListReporter::Core : std::enable_shared_from_this<Core> {
             timer.reset();
             target = url;
         }
-        on.offload([self = shared_from_this(), target] {
+        // The send ends when the work has run, or when the pool dropped it at its stop.
+        std::shared_ptr<void> ended(nullptr, [self = shared_from_this()](void*) { self->sent(); });
+        on.offload([self = shared_from_this(), target, ended = std::move(ended)]() mutable {
             self->owner.send(target);
-            std::lock_guard<std::mutex> lock(self->mutex);
-            self->sending = false;
-            self->changed.notify_all();
-            if (self->pending && self->loop) self->scheduleLocked();
+            ended.reset();
         });
+    }
+    // Pool (or wherever the send's work is dropped).
+    void sent() {
+        std::lock_guard<std::mutex> lock(mutex);
+        sending = false;
+        changed.notify_all();
+        if (pending && loop) scheduleLocked();
     }
     // Drops the waiting report and its timer (lock held).
     void dropLocked() {
