@@ -149,7 +149,7 @@ void FileMonitor::announce() {
         if (socket.initial(static_cast<std::uint16_t>(pushClientPort_), "127.0.0.1", -1))
             socket.sendMsg(-1, Bytes(query.begin(), query.end()));
     }
-    EventPublisher::instance().notifySubscribers("AccountChangeEvent");
+    EventPublisher::instance().notifySubscribers(ServiceEvent::AccountChange);
 }
 
 void FileMonitor::enterState(DatabaseState next, const std::string& detail) {

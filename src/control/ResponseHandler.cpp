@@ -137,7 +137,7 @@ std::string preconnectPreconnectConnect(const requestObj& request) {
 
 std::string preconnectStartScan(const requestObj&) {
     Utils::mPrintlog("preconnect_startScan Request ...");
-    EventPublisher::instance().notifySubscribers("DeviceListUpdate");
+    EventPublisher::instance().notifySubscribers(ServiceEvent::DeviceListUpdate);
     auto& registry = DeviceWaitForPreConnectManager::instance();
     registry.waitForDevices(Config::current().preconnectScanWait);  // ends as soon as one is there
     Json list = Json::array();
@@ -224,10 +224,10 @@ std::string accountChange(const requestObj& request) {
         });
         if (!openid.empty()) {
             sendClientIdQuery(openid);
-            EventPublisher::instance().notifySubscribers("PcsuiteEvent");
-            EventPublisher::instance().notifySubscribers("DeviceInfoReport");
+            EventPublisher::instance().notifySubscribers(ServiceEvent::Pcsuite);
+            EventPublisher::instance().notifySubscribers(ServiceEvent::DeviceInfoReport);
         } else {
-            EventPublisher::instance().notifySubscribers("AccountChangeEvent");
+            EventPublisher::instance().notifySubscribers(ServiceEvent::AccountChange);
         }
     } else if (!params.empty()) {
         Utils::mPrintlog("account change param error, nothing changed \n");
@@ -340,7 +340,7 @@ std::string ResponseHandler::create(const requestObj& request) {
             return Utils::openWlanSetting();
         case RequestEvent::preconnect_enterConnectCenter:
             Utils::mPrintlog("preconnect_enterConnectCenter Request ...");
-            EventPublisher::instance().notifySubscribers("PcsuiteEvent");
+            EventPublisher::instance().notifySubscribers(ServiceEvent::Pcsuite);
             return response(0, "Preconnect_enterConnectCenter success");
         case RequestEvent::preconnect_startScan:
             return preconnectStartScan(request);

@@ -1,5 +1,7 @@
 #include "core/EventLoop.h"
 
+#include <pthread.h>
+
 #include <exception>
 #include <string>
 
@@ -17,6 +19,7 @@ void EventLoop::start() {
     guard_.emplace(io_.get_executor());
     thread_ = std::thread([this] {
         loopThread_.store(std::this_thread::get_id());
+        pthread_setname_np(pthread_self(), "kesu-loop");
         for (;;) {
             try {
                 io_.run();
@@ -45,6 +48,13 @@ void EventLoop::stop() {
         io_.stop();
         thread_.join();
     }
+}
+
+void EventLoop::nameWorker() {
+    thread_local bool named = false;
+    if (named) return;
+    named = true;
+    pthread_setname_np(pthread_self(), "kesu-pool");
 }
 
 std::shared_ptr<asio::thread_pool> EventLoop::pool() {

@@ -57,6 +57,7 @@ public:
     template <class Work, class Done>
     void offload(Work work, Done done) {
         asio::post(*pool(), [this, work = std::move(work), done = std::move(done)]() mutable {
+            nameWorker();
             if constexpr (std::is_void_v<std::invoke_result_t<Work&>>) {
                 work();
                 asio::post(io_, std::move(done));
@@ -86,7 +87,10 @@ public:
     // Runs `work` on the worker pool (fire and forget).
     template <class Work>
     void offload(Work work) {
-        asio::post(*pool(), std::move(work));
+        asio::post(*pool(), [work = std::move(work)]() mutable {
+            nameWorker();
+            work();
+        });
     }
 
     // Runs `fn` on the loop and waits for its result, at most `timeout`; nullopt (or false
@@ -118,6 +122,9 @@ public:
     }
 
 private:
+    // Names the calling pool thread "kesu-pool" (once per thread), so that it can be told
+    // apart in the process's thread list.
+    static void nameWorker();
     // The pool, made on first use; work posted to it after stop() is dropped.
     std::shared_ptr<asio::thread_pool> pool();
 

@@ -1,54 +1,96 @@
 #include "core/HttpAliveCheck.h"
 
+#include <asio/steady_timer.hpp>
+
+#include <condition_variable>
+#include <mutex>
+
 #include "control/HttpService.h"
 #include "core/Config.h"
+#include "core/EventLoop.h"
 #include "core/Utils.h"
 
 namespace kesu {
 
-HttpAliveCheck::HttpAliveCheck(std::function<bool()> probe)
-    : probe_(probe ? std::move(probe) : std::function<bool()>([] { return Utils::isHttpAlive(); })) {
-    thread_ = std::thread([this] { httpKeepAliveCheck(); });
+struct HttpAliveCheck::State : std::enable_shared_from_this<State> {
+    State(EventLoop& l, std::function<bool()> p) : loop(l), probe(std::move(p)), pause(l.context()) {}
+
+    // Loop: one round, HeartBeat then (when it failed) stop, pause, start.
+    void check() {
+        {
+            std::lock_guard<std::mutex> lock(mutex);
+            if (stopped || working) return;
+            working = true;
+        }
+        auto self = shared_from_this();
+        loop.offload([self] { return self->probe(); }, [self](bool alive) {
+            if (alive || self->isStopped()) return self->finish(false);
+            Utils::mPrintlog("[CheckHttpAlive::keepCheckHttpAlive] Http is stop! Restart http service!");
+            self->loop.offload([] { HttpService::httpService().stop(); }, [self] {
+                if (self->isStopped()) return self->finish(false);
+                self->pause.expires_after(Config::current().httpRestartPause);
+                self->pause.async_wait([self](const std::error_code& error) {
+                    if (error || self->isStopped()) return self->finish(false);
+                    // A failure to start is retried next round.
+                    self->loop.offload([] { HttpService::httpService().startHttpServic(); },
+                                       [self] { self->finish(true); });
+                });
+            });
+        });
+    }
+    bool isStopped() {
+        std::lock_guard<std::mutex> lock(mutex);
+        return stopped;
+    }
+    void finish(bool restarted) {
+        std::lock_guard<std::mutex> lock(mutex);
+        working = false;
+        if (restarted) ++restarts;
+        cv.notify_all();
+    }
+
+    EventLoop& loop;
+    const std::function<bool()> probe;
+    asio::steady_timer pause;  // loop only
+
+    std::mutex mutex;
+    std::condition_variable cv;
+    bool stopped = false;
+    bool working = false;  // a round is under way
+    int restarts = 0;
+};
+
+HttpAliveCheck::HttpAliveCheck(EventLoop& loop, std::function<bool()> probe)
+    : state_(std::make_shared<State>(loop, probe ? std::move(probe)
+                                                 : std::function<bool()>([] { return Utils::isHttpAlive(); }))),
+      timer_(loop.context(), [] { return Config::current().httpWatchdogPeriod; },
+             [state = state_] { state->check(); }) {
+    timer_.start();
 }
 
 HttpAliveCheck::~HttpAliveCheck() { stop(); }
 
 void HttpAliveCheck::stop() {
+    timer_.stop();
     {
-        std::lock_guard<std::mutex> lock(mutex_);
-        stopped_ = true;
+        std::lock_guard<std::mutex> lock(state_->mutex);
+        state_->stopped = true;
     }
-    cv_.notify_all();
-    if (thread_.joinable() && thread_.get_id() != std::this_thread::get_id()) thread_.join();
+    state_->loop.post([state = state_] { state->pause.cancel(); });
+    // The HeartBeat gives up after its own time-out; the server's stop and start are short.
+    std::unique_lock<std::mutex> lock(state_->mutex);
+    state_->cv.wait_for(lock, Config::current().httpAliveTimeout + std::chrono::seconds(10),
+                        [this] { return !state_->working; });
 }
 
 int HttpAliveCheck::restarts() const {
-    std::lock_guard<std::mutex> lock(mutex_);
-    return restarts_;
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    return state_->restarts;
 }
 
 bool HttpAliveCheck::waitForRestarts(int count, std::chrono::milliseconds timeout) {
-    std::unique_lock<std::mutex> lock(mutex_);
-    return cv_.wait_for(lock, timeout, [&] { return restarts_ >= count; });
-}
-
-bool HttpAliveCheck::waitStopped(std::chrono::milliseconds period) {
-    std::unique_lock<std::mutex> lock(mutex_);
-    return cv_.wait_for(lock, period, [this] { return stopped_; });
-}
-
-void HttpAliveCheck::httpKeepAliveCheck() {
-    for (;;) {
-        if (waitStopped(Config::current().httpWatchdogPeriod)) return;
-        if (probe_()) continue;
-        Utils::mPrintlog("[CheckHttpAlive::keepCheckHttpAlive] Http is stop! Restart http service!");
-        HttpService::httpService().stop();
-        if (waitStopped(Config::current().httpRestartPause)) return;
-        HttpService::httpService().startHttpServic();  // a failure is retried next pass
-        std::lock_guard<std::mutex> lock(mutex_);
-        ++restarts_;
-        cv_.notify_all();
-    }
+    std::unique_lock<std::mutex> lock(state_->mutex);
+    return state_->cv.wait_for(lock, timeout, [&] { return state_->restarts >= count; });
 }
 
 }  // namespace kesu

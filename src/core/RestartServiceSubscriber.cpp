@@ -7,18 +7,10 @@
 
 namespace kesu {
 
-RestartServiceSubscriber::RestartServiceSubscriber() : IEventSubscriber({"LogOnEvent"}) {}
+RestartServiceSubscriber::RestartServiceSubscriber(EventLoop& loop) : IEventSubscriber(loop, {ServiceEvent::LogOn}) {}
 
-void RestartServiceSubscriber::notify(const std::string& eventName) {
-    if (!getIsNotify() && eventName == "LogOnEvent") dispatchDetached(eventName);
-}
-
-bool RestartServiceSubscriber::eventNotify(const std::string&) {
-    std::lock_guard<std::mutex> guard(lock);
-    setIsNotify(true);
+void RestartServiceSubscriber::eventNotify(ServiceEvent) {
     if (Utils::getIsCanConnectDevice() && connServiceRunOutOfDate()) Utils::restartService();
-    setIsNotify(false);
-    return true;
 }
 
 std::optional<Utils::Clock::time_point> RestartServiceSubscriber::versionUpdateTime(const std::string& content) {

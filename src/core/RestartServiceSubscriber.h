@@ -12,10 +12,9 @@ namespace kesu {
 
 class RestartServiceSubscriber : public IEventSubscriber {
 public:
-    RestartServiceSubscriber();
+    explicit RestartServiceSubscriber(EventLoop& loop);
 
-    void notify(const std::string& eventName) override;
-    bool eventNotify(const std::string& eventName) override;
+    void eventNotify(ServiceEvent event) override;
     // True when the version file's update time lies more than `restartServiceDay` whole days
     // back. A missing, empty or unparsable file counts as current.
     bool connServiceRunOutOfDate();

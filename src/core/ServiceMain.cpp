@@ -44,7 +44,7 @@ int runService() {
     loop.start();
     ServiceManager manager(loop);
     manager.start();
-    HttpAliveCheck watchdog;
+    HttpAliveCheck watchdog(loop);
 
     int signalNumber = 0;
     while (sigwait(&stopSignals, &signalNumber) != 0) {

@@ -6,12 +6,12 @@
 #include "core/EventLoop.h"
 #include "core/RestartServiceSubscriber.h"
 #include "events/EventDetected.h"
-#include "events/PreConnectEventSubscriber.h"
 #include "events/SystemEventSubscriber.h"
 #include "core/Utils.h"
 #include "discovery/ServiceWorker.h"
 #include "pcsuite/DeviceReports.h"
 #include "events/EventPublisher.h"
+#include "preconnect/PreConnectEventSubscriber.h"
 
 namespace kesu {
 
@@ -34,17 +34,21 @@ void ServiceManager::start() {
 
     // LAN device list: a first report now, then on every new or changed device and on expiry.
     wlanReportDevices_ = std::make_shared<WlanReportDevices>();
+    wlanReportDevices_->start(loop_);
     wlanReportDevices_->notify();
     WlanDetectedDeviceCompare::instance().addObserver(wlanReportDevices_);
-    wlanDeviceDelete_ = std::make_unique<WlanDeviceDelete>();
+    wlanDeviceDelete_ = std::make_unique<WlanDeviceDelete>(loop_);
     wlanDeviceDelete_->addObserver(wlanReportDevices_);
     wlanDeviceDelete_->detectedToDelete(Config::current().expirySweepPeriod);
 
+    ReportDevicesV2::instance().start(loop_);
+
     // Event subscribers, in their registration order.
-    subscribers_ = {std::make_shared<PreConnectEventSubscriber>(), std::make_shared<RestartServiceSubscriber>(),
-                    std::make_shared<SystemEventSubscriber>()};
+    subscribers_ = {std::make_shared<PreConnectEventSubscriber>(loop_),
+                    std::make_shared<RestartServiceSubscriber>(loop_),
+                    std::make_shared<SystemEventSubscriber>(loop_)};
     for (const auto& subscriber : subscribers_) EventPublisher::instance().addObserver(subscriber);
-    eventDetected_ = std::make_unique<EventDetected>();
+    eventDetected_ = std::make_unique<EventDetected>(loop_);
 }
 
 void ServiceManager::stop() {
@@ -57,7 +61,7 @@ void ServiceManager::stop() {
     Pcuitinterface::setLoop(nullptr);
     eventDetected_.reset();
     EventPublisher::instance().clearObservers();
-    for (const auto& subscriber : subscribers_) subscriber->waitIdle(std::chrono::seconds(5));
+    for (const auto& subscriber : subscribers_) subscriber->stop(std::chrono::seconds(5));
     subscribers_.clear();
     // Device list reports: no more sweeps, no reporter left behind, nothing waiting to go.
     if (wlanDeviceDelete_) wlanDeviceDelete_->stop();
@@ -67,7 +71,7 @@ void ServiceManager::stop() {
         wlanReportDevices_->stop();
     }
     wlanReportDevices_.reset();
-    ReportDevicesV2::instance().cancel();
+    ReportDevicesV2::instance().stop();
 }
 
 void ServiceManager::restart() {

@@ -19,7 +19,7 @@ namespace {
 const std::string kWifi = "Wi-Fi";
 const std::string kEthernet = "Ethernet";
 
-void publish(const std::string& eventName) { EventPublisher::instance().notifySubscribers(eventName); }
+void publish(ServiceEvent event) { EventPublisher::instance().notifySubscribers(event); }
 
 std::string interfaceOf(const std::string& kind, const std::string& wifiName, const std::string& ethernetName) {
     return kind == kWifi ? wifiName : ethernetName;
@@ -123,7 +123,7 @@ void KesuAdapterManager::check() {
     const bool wifiOn = isWiFiEnabled();
     if (wifiOn != wifiSwitch) {
         wifiSwitch = !wifiSwitch;
-        publish(wifiOn ? "WifiOpenEvent" : "WifiCloseEvent");
+        publish(wifiOn ? ServiceEvent::WifiOpen : ServiceEvent::WifiClose);
     }
 
     // 2. The current snapshot and the interface names of this moment.
@@ -145,10 +145,10 @@ void KesuAdapterManager::check() {
         if (known == previous.end()) {
             statusLine(current);
             Utils::mPrintlog("[checkNetWorkStatus] adapter add \n");
-            publish("NetworkChangeEvent");
+            publish(ServiceEvent::NetworkChange);
             addSocket(kind, name);
             logInterface(kind, name);
-            publish(isWifi ? "WlanNetConnectEvent" : "WiredNetConnectEvent");
+            publish(isWifi ? ServiceEvent::WlanNetConnect : ServiceEvent::WiredNetConnect);
             continue;
         }
 
@@ -178,11 +178,11 @@ void KesuAdapterManager::check() {
 
         statusLine(current);
         Utils::mPrintlog("[checkNetWorkStatus] ip is change \n");
-        publish("NetworkChangeEvent");
+        publish(ServiceEvent::NetworkChange);
         rebuildSocket(kind, name);
         const std::string& oldAddress = known->second;
-        const char* connect = isWifi ? "WlanNetConnectEvent" : "WiredNetConnectEvent";
-        const char* disconnect = isWifi ? "WlanNetDisconnectEvent" : "WiredNetDisconnectEvent";
+        const ServiceEvent connect = isWifi ? ServiceEvent::WlanNetConnect : ServiceEvent::WiredNetConnect;
+        const ServiceEvent disconnect = isWifi ? ServiceEvent::WlanNetDisconnect : ServiceEvent::WiredNetDisconnect;
         if (oldAddress.empty()) {
             publish(connect);
         } else if (address.empty()) {
@@ -199,17 +199,17 @@ void KesuAdapterManager::check() {
     // 5. Adapters removed.
     for (const auto& [kind, address] : previous) {
         if (current.contains(kind)) continue;
-        publish("NetworkChangeEvent");
+        publish(ServiceEvent::NetworkChange);
         statusLine(current);
         Utils::mPrintlog("[checkNetWorkStatus] adapter remove \n");
         if (kind == kWifi) {
             const std::string name = removeSocket(kind, wifiName);
             Utils::mPrintlog("[checkNetWorkStatus] wifiName is " + name + "\n");
-            publish("WlanNetDisconnectEvent");
+            publish(ServiceEvent::WlanNetDisconnect);
         } else if (kind == kEthernet) {
             const std::string name = removeSocket(kind, ethernetName);
             Utils::mPrintlog("[checkNetWorkStatus] ethernetName is " + name + " \n");
-            publish("WiredNetDisconnectEvent");
+            publish(ServiceEvent::WiredNetDisconnect);
         }
     }
 

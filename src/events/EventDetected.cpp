@@ -1,36 +1,44 @@
 #include "events/EventDetected.h"
 
 #include "core/Config.h"
+#include "core/EventLoop.h"
 #include "core/Utils.h"
 #include "events/EventPublisher.h"
 
 namespace kesu {
 
-EventDetected::EventDetected() { thread_ = std::thread([this] { screenUnlockedDetected(); }); }
+// Loop only.
+struct EventDetected::State {
+    bool unlocked = true;  // no event at start while the screen stays unlocked
+    bool checking = false;
+    bool stopped = false;
+};
+
+EventDetected::EventDetected(EventLoop& loop)
+    : loop_(loop),
+      state_(std::make_shared<State>()),
+      timer_(loop.context(), [] { return Config::current().screenLockPeriod; },
+             [&loop, state = state_] {
+                 if (state->checking) return;  // the previous check still runs
+                 state->checking = true;
+                 loop.offload([] { return Utils::isScreenUnlocked(); }, [state](bool unlocked) {
+                     state->checking = false;
+                     if (state->stopped || unlocked == state->unlocked) return;
+                     state->unlocked = unlocked;
+                     EventPublisher::instance().notifySubscribers(unlocked ? ServiceEvent::LogOn
+                                                                           : ServiceEvent::LogOut);
+                 });
+             }) {
+    timer_.start();
+}
 
 EventDetected::~EventDetected() { stop(); }
 
 void EventDetected::stop() {
-    {
-        std::lock_guard<std::mutex> lock(mutex_);
-        stopped_ = true;
-    }
-    cv_.notify_all();
-    if (thread_.joinable()) thread_.join();
-}
-
-void EventDetected::screenUnlockedDetected() {
-    bool unlocked = true;  // no event at start while the screen stays unlocked
-    for (;;) {
-        {
-            std::unique_lock<std::mutex> lock(mutex_);
-            if (cv_.wait_for(lock, Config::current().screenLockPeriod, [this] { return stopped_; })) return;
-        }
-        const bool now = Utils::isScreenUnlocked();
-        if (now == unlocked) continue;
-        unlocked = now;
-        EventPublisher::instance().notifySubscribers(unlocked ? "LogOnEvent" : "LogOutEvent");
-    }
+    loop_.call([this] {
+        timer_.stop();
+        state_->stopped = true;
+    });
 }
 
 }  // namespace kesu

@@ -1,28 +1,31 @@
-// The screen-lock watcher: publishes "LogOutEvent" when the screen gets locked and
-// "LogOnEvent" when it gets unlocked, checking every few seconds.
+// The screen-lock watcher: publishes LogOut when the screen gets locked and LogOn when it
+// gets unlocked, checking every few seconds (a timer on the loop; the check itself launches
+// a program, so it runs on the worker pool).
 #pragma once
 
-#include <condition_variable>
-#include <mutex>
-#include <thread>
+#include <memory>
+
+#include "core/PeriodicTimer.h"
 
 namespace kesu {
 
+class EventLoop;
+
 class EventDetected {
 public:
-    EventDetected();  // starts the watcher
-    ~EventDetected();
+    explicit EventDetected(EventLoop& loop);  // starts the watcher
+    ~EventDetected();                         // stop()
     EventDetected(const EventDetected&) = delete;
     EventDetected& operator=(const EventDetected&) = delete;
+    // No check starts after this; a check under way publishes nothing.
     void stop();
 
 private:
-    void screenUnlockedDetected();
+    struct State;
 
-    std::mutex mutex_;
-    std::condition_variable cv_;
-    bool stopped_ = false;
-    std::thread thread_;
+    EventLoop& loop_;
+    std::shared_ptr<State> state_;
+    PeriodicTimer timer_;
 };
 
 }  // namespace kesu

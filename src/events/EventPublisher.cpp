@@ -1,5 +1,7 @@
 #include "events/EventPublisher.h"
 
+#include <string>
+
 #include "core/Utils.h"
 
 namespace kesu {
@@ -15,9 +17,10 @@ void EventPublisher::addObserver(std::shared_ptr<IEventSubscriber> observer) {
     m_observer.push_back(std::move(observer));
 }
 
-void EventPublisher::notifySubscribers(const std::string& eventName) {
-    Utils::mPrintlog("[EventPublisher::notifySubscribers] notifySubscribers event is: " + eventName);
-    for (const auto& observer : observers()) observer->notify(eventName);
+void EventPublisher::notifySubscribers(ServiceEvent event) {
+    Utils::mPrintlog(std::string("[EventPublisher::notifySubscribers] notifySubscribers event is: ") +
+                     eventName(event));
+    for (const auto& observer : observers()) observer->notify(event);
 }
 
 void EventPublisher::clearObservers() {

@@ -1,10 +1,10 @@
-// The process-wide publish/subscribe bus of named events. Publishing calls every
-// subscriber's notify in registration order on the publisher's thread.
+// The process-wide publish/subscribe bus. Publishing logs the event and hands it to every
+// subscriber in registration order; each subscriber queues it and handles it on the worker
+// pool (see IEventSubscriber), so publishing never waits for a handler.
 #pragma once
 
 #include <memory>
 #include <mutex>
-#include <string>
 #include <vector>
 
 #include "events/IEventSubscriber.h"
@@ -16,7 +16,7 @@ public:
     static EventPublisher& instance();
 
     void addObserver(std::shared_ptr<IEventSubscriber> observer);
-    void notifySubscribers(const std::string& eventName);
+    void notifySubscribers(ServiceEvent event);
     // Drops every subscriber (tests, orderly stop).
     void clearObservers();
     std::vector<std::shared_ptr<IEventSubscriber>> observers() const;

@@ -5,31 +5,28 @@
 
 namespace kesu {
 
-SystemEventSubscriber::SystemEventSubscriber()
-    : IEventSubscriber({"WifiOpenEvent", "LogOnEvent", "LogOutEvent", "WlanNetConnectEvent", "WlanNetDisconnectEvent",
-                        "WiredNetDisconnectEvent", "WiredNetConnectEvent"}) {}
+SystemEventSubscriber::SystemEventSubscriber(EventLoop& loop)
+    : IEventSubscriber(loop, {ServiceEvent::WifiOpen, ServiceEvent::LogOn, ServiceEvent::LogOut,
+                              ServiceEvent::WlanNetConnect, ServiceEvent::WlanNetDisconnect,
+                              ServiceEvent::WiredNetDisconnect, ServiceEvent::WiredNetConnect}) {}
 
-bool SystemEventSubscriber::eventNotify(const std::string& eventName) {
-    std::lock_guard<std::mutex> guard(lock);
-    setIsNotify(true);
-    systemEventNotifyHandle(eventName);
-    networkChangeDuringConnectionHandle(eventName);
-    setIsNotify(false);
-    return true;
+void SystemEventSubscriber::eventNotify(ServiceEvent event) {
+    systemEventNotifyHandle(event);
+    networkChangeDuringConnectionHandle(event);
 }
 
-void SystemEventSubscriber::systemEventNotifyHandle(const std::string& eventName) {
-    if (!handles(eventName)) return;
+void SystemEventSubscriber::systemEventNotifyHandle(ServiceEvent event) {
+    if (!handles(event)) return;
     Json body = Json::object();
-    if (eventName == "LogOnEvent") body = {{"event", "LogOn"}, {"status", 1}};
-    else if (eventName == "LogOutEvent") body = {{"event", "LogOn"}, {"status", 0}};
-    else if (eventName == "WifiOpenEvent") body = {{"event", "wifi"}, {"status", 1}};
+    if (event == ServiceEvent::LogOn) body = {{"event", "LogOn"}, {"status", 1}};
+    else if (event == ServiceEvent::LogOut) body = {{"event", "LogOn"}, {"status", 0}};
+    else if (event == ServiceEvent::WifiOpen) body = {{"event", "wifi"}, {"status", 1}};
     std::string response;
     Utils::httpMsgSend(json::compact(body), Utils::pcsuiteHttpServerNotifySystemEventUrl(), "POST", response);
 }
 
-void SystemEventSubscriber::networkChangeDuringConnectionHandle(const std::string& eventName) {
-    if (!handles(eventName)) return;
+void SystemEventSubscriber::networkChangeDuringConnectionHandle(ServiceEvent event) {
+    if (!handles(event)) return;
     std::string deviceType, status;
     if (Utils::isDeviceConnectable("phone", deviceType, status) &&
         Utils::isDeviceConnectable("pad", deviceType, status)) {
@@ -37,10 +34,10 @@ void SystemEventSubscriber::networkChangeDuringConnectionHandle(const std::strin
         return;
     }
     int netType = 0, state = 0;
-    if (eventName == "WlanNetDisconnectEvent") netType = 1, state = 2;
-    else if (eventName == "WlanNetConnectEvent") netType = 1, state = 1;
-    else if (eventName == "WiredNetDisconnectEvent") netType = 4, state = 2;
-    else if (eventName == "WiredNetConnectEvent") netType = 4, state = 1;
+    if (event == ServiceEvent::WlanNetDisconnect) netType = 1, state = 2;
+    else if (event == ServiceEvent::WlanNetConnect) netType = 1, state = 1;
+    else if (event == ServiceEvent::WiredNetDisconnect) netType = 4, state = 2;
+    else if (event == ServiceEvent::WiredNetConnect) netType = 4, state = 1;
     else return;
     const Json record = {{"type", 1}, {"eventId", "W688|10308"}, {"params", {{"net_type", netType}, {"state", state}}}};
     const std::string buryPointStr = "[" + json::pretty(record) + "]";

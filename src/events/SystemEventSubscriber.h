@@ -8,11 +8,11 @@ namespace kesu {
 
 class SystemEventSubscriber : public IEventSubscriber {
 public:
-    SystemEventSubscriber();
-    bool eventNotify(const std::string& eventName) override;
+    explicit SystemEventSubscriber(EventLoop& loop);
+    void eventNotify(ServiceEvent event) override;
 
-    void systemEventNotifyHandle(const std::string& eventName);
-    void networkChangeDuringConnectionHandle(const std::string& eventName);
+    void systemEventNotifyHandle(ServiceEvent event);
+    void networkChangeDuringConnectionHandle(ServiceEvent event);
 };
 
 }  // namespace kesu

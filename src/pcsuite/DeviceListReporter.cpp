@@ -1,5 +1,15 @@
 #include "pcsuite/DeviceListReporter.h"
 
+#include <asio/steady_timer.hpp>
+
+#include <algorithm>
+#include <condition_variable>
+#include <cstdint>
+#include <mutex>
+#include <optional>
+
+#include "core/EventLoop.h"
+
 #include "core/Config.h"
 #include "core/Json.h"
 #include "core/Utils.h"
@@ -30,80 +40,100 @@ std::string listText(const Range& items, ToJson toJson) {
 
 // ---- DeviceListReporter ---------------------------------------------------------------------
 
+// The scheduling state, shared with the timers and the pool work so that none of them
+// outlives what it touches. Guarded by `mutex`; the timer objects are used on the loop only.
+struct DeviceListReporter::Core : std::enable_shared_from_this<Core> {
+    using Steady = std::chrono::steady_clock;
+
+    explicit Core(DeviceListReporter& o) : owner(o) {}
+
+    // Queues the arming of the send timer for the pending list (lock held, not sending).
+    void scheduleLocked() {
+        Steady::time_point at = due;
+        if (lastStart) at = std::max(at, *lastStart + Config::current().reportThrottle);
+        loop->post([self = shared_from_this(), on = loop, at, round = epoch] { self->arm(*on, at, round); });
+    }
+    // Loop.
+    void arm(EventLoop& on, Steady::time_point at, std::uint64_t round) {
+        auto t = std::make_shared<asio::steady_timer>(on.context(), at);
+        {
+            std::lock_guard<std::mutex> lock(mutex);
+            if (round != epoch || loop != &on) return;
+            timer = t;
+        }
+        t->async_wait([self = shared_from_this(), &on, round](const std::error_code& error) {
+            if (!error) self->fire(on, round);
+        });
+    }
+    // Loop: the list is built from here on, so a change after this needs a send of its own.
+    void fire(EventLoop& on, std::uint64_t round) {
+        std::string target;
+        {
+            std::lock_guard<std::mutex> lock(mutex);
+            if (round != epoch || loop != &on || !pending || sending) return;
+            pending = false;
+            sending = true;
+            lastStart = Steady::now();
+            timer.reset();
+            target = url;
+        }
+        // The send ends when the work has run, or when the pool dropped it at its stop.
+        std::shared_ptr<void> ended(nullptr, [self = shared_from_this()](void*) { self->sent(); });
+        on.offload([self = shared_from_this(), target, ended = std::move(ended)]() mutable {
+            self->owner.send(target);
+            ended.reset();
+        });
+    }
+    // Pool (or wherever the send's work is dropped).
+    void sent() {
+        std::lock_guard<std::mutex> lock(mutex);
+        sending = false;
+        changed.notify_all();
+        if (pending && loop) scheduleLocked();
+    }
+    // Drops the waiting report and its timer (lock held).
+    void dropLocked() {
+        pending = false;
+        ++epoch;
+        if (timer && loop) loop->post([t = std::move(timer)] { t->cancel(); });
+        timer.reset();
+    }
+
+    DeviceListReporter& owner;
+    std::mutex mutex;
+    std::condition_variable changed;
+    EventLoop* loop = nullptr;                // set while started
+    bool pending = false;                     // a list is wanted that has not been built yet
+    bool sending = false;                     // a list is being built and posted
+    std::uint64_t epoch = 0;                  // bumped by cancel(): older timers do nothing
+    Steady::time_point due;                   // first notify of the pending list + reportDelay
+    std::string url;
+    std::optional<Steady::time_point> lastStart;  // start of the previous send
+    std::shared_ptr<asio::steady_timer> timer;    // the armed send timer (touched on the loop)
+};
+
+DeviceListReporter::DeviceListReporter() : core_(std::make_shared<Core>(*this)) {}
+
 DeviceListReporter::~DeviceListReporter() { stop(); }
+
+void DeviceListReporter::start(EventLoop& loop) {
+    std::lock_guard<std::mutex> lock(core_->mutex);
+    core_->loop = &loop;
+}
 
 void DeviceListReporter::notify() {
     const std::string url = reportUrl();
     const auto delay = Config::current().reportDelay;
-    std::lock_guard<std::mutex> guard(state_);
-    if (stopping_) return;
-    if (pending_) return;  // the list still to be built carries this change too
-    pending_ = true;
-    pendingSince_ = Steady::now();
-    pendingDelay_ = delay;
-    pendingUrl_ = url;
-    if (!worker_.joinable()) worker_ = std::thread([this] { run(); });
-    changed_.notify_all();
-}
-
-void DeviceListReporter::run() {
-    std::unique_lock<std::mutex> state(state_);
-    for (;;) {
-        changed_.wait(state, [this] { return stopping_ || pending_; });
-        if (stopping_) return;
-        const std::uint64_t epoch = epoch_;
-        // The pause lets the table settle: a burst of announcements goes as one list.
-        changed_.wait_until(state, pendingSince_ + pendingDelay_, [&] { return stopping_ || epoch_ != epoch; });
-        if (stopping_) return;
-        if (epoch_ != epoch) continue;  // cancelled while waiting
-        const std::string url = pendingUrl_;
-        state.unlock();
-        sendRound(url, epoch);
-        state.lock();
-    }
+    std::lock_guard<std::mutex> lock(core_->mutex);
+    if (!core_->loop) return;
+    if (core_->pending) return;  // the list still to be built carries this change too
+    core_->pending = true;
+    core_->due = Core::Steady::now() + delay;  // the pause lets a burst go as one list
+    core_->url = url;
+    if (!core_->sending) core_->scheduleLocked();  // else the end of that post schedules it
 }
 
 bool DeviceListReporter::send(const std::string& url) {
-    std::uint64_t epoch = 0;
-    {
-        std::lock_guard<std::mutex> guard(state_);
-        epoch = epoch_;
-    }
-    return sendRound(url, epoch);
-}
-
-bool DeviceListReporter::sendRound(const std::string& url, std::uint64_t epoch) {
-    std::lock_guard<std::mutex> sendGuard(lock);
-    {
-        std::lock_guard<std::mutex> guard(state_);
-        if (stopping_ || epoch_ != epoch) return false;
-        ++sending_;
-    }
-    setIsNotify(true);
-    // Whatever way the send ends: not busy any more.
-    struct Done {
-        DeviceListReporter& self;
-        ~Done() {
-            self.setIsNotify(false);
-            std::lock_guard<std::mutex> guard(self.state_);
-            --self.sending_;
-            self.changed_.notify_all();
-        }
-    } done{*this};
-
-    // Throttle: at least reportThrottle between the starts of two sends.
-    const auto throttle = Config::current().reportThrottle;
-    {
-        std::unique_lock<std::mutex> state(state_);
-        if (lastTime) {
-            changed_.wait_until(state, *lastTime + throttle, [&] { return stopping_ || epoch_ != epoch; });
-            if (stopping_ || epoch_ != epoch) return false;
-        }
-        lastTime = Steady::now();
-        // The list is built after this point: a change from now on needs a send of its own.
-        pending_ = false;
-    }
-
     if (!mayReport()) return false;
     if (!Utils::isAppRunning(pcsuiteAppName)) return false;
 
@@ -115,29 +145,21 @@ bool DeviceListReporter::sendRound(const std::string& url, std::uint64_t epoch) 
 }
 
 void DeviceListReporter::cancel() {
-    std::unique_lock<std::mutex> state(state_);
-    pending_ = false;
-    ++epoch_;
-    changed_.notify_all();
-    changed_.wait(state, [this] { return sending_ == 0; });
+    std::unique_lock<std::mutex> lock(core_->mutex);
+    core_->dropLocked();
+    core_->changed.wait(lock, [this] { return !core_->sending; });
 }
 
 void DeviceListReporter::stop() {
-    {
-        std::lock_guard<std::mutex> guard(state_);
-        stopping_ = true;
-        pending_ = false;
-        ++epoch_;
-    }
-    changed_.notify_all();
-    if (worker_.joinable() && worker_.get_id() != std::this_thread::get_id()) worker_.join();
-    std::unique_lock<std::mutex> state(state_);
-    changed_.wait(state, [this] { return sending_ == 0; });
+    std::unique_lock<std::mutex> lock(core_->mutex);
+    core_->dropLocked();
+    core_->loop = nullptr;
+    core_->changed.wait(lock, [this] { return !core_->sending; });
 }
 
 bool DeviceListReporter::waitIdle(std::chrono::milliseconds timeout) {
-    std::unique_lock<std::mutex> state(state_);
-    return changed_.wait_for(state, timeout, [this] { return !pending_ && sending_ == 0; });
+    std::unique_lock<std::mutex> lock(core_->mutex);
+    return core_->changed.wait_for(lock, timeout, [this] { return !core_->pending && !core_->sending; });
 }
 
 // ---- WlanReportDevices ----------------------------------------------------------------------
@@ -147,7 +169,7 @@ WlanReportDevices::WlanReportDevices() : WlanReportDevices(SsdpDeviceManager::in
 WlanReportDevices::WlanReportDevices(SsdpDeviceManager& manager)
     : manager_(manager) {}
 
-// Stopped here, while the whole object still exists: the thread calls the overrides.
+// Stopped here, while the whole object still exists: a send under way calls the overrides.
 WlanReportDevices::~WlanReportDevices() { stop(); }
 
 std::string WlanReportDevices::reportUrl() const { return Utils::pcsuiteHttpServerSSDPQuerryAllUrl(); }

@@ -2,54 +2,50 @@
 // pre-connect list (ReportDevicesV2), and the throttled, coalescing send they share.
 #pragma once
 
-#include <atomic>
 #include <chrono>
-#include <condition_variable>
-#include <cstdint>
-#include <mutex>
-#include <optional>
+#include <memory>
 #include <string>
-#include <thread>
 
 namespace kesu {
 
+class EventLoop;
 class SsdpDeviceManager;
 class DeviceWaitForPreConnectManager;
 
-// One reporter: notify() asks for the list to be sent; a thread of the reporter's own sends
-// it reportDelay later, at least reportThrottle after its previous list, when the PC suite's
-// application runs. Changes that arrive before the list is built ride along with that send
-// (dropped, never queued); a change that arrives while a built list is being posted leaves
-// exactly one follow-up send, so the PC suite always ends up with the current list.
+// One reporter: notify() asks for the list to be sent; reportDelay later (a timer on the
+// loop), at least reportThrottle after the start of its previous send, and when the PC
+// suite's application runs, the list is built and posted on the loop's worker pool. Changes
+// that arrive before the list is built ride along with that send (never queued twice); a
+// change that arrives while a built list is being posted leaves exactly one follow-up send,
+// so the PC suite always ends up with the current list. No thread of its own.
 class DeviceListReporter {
 public:
     // The application whose presence the reports depend on.
     static inline const std::string pcsuiteAppName = "kesu办公套件";
 
-    virtual ~DeviceListReporter();
+    virtual ~DeviceListReporter();  // stop()
     DeviceListReporter(const DeviceListReporter&) = delete;
     DeviceListReporter& operator=(const DeviceListReporter&) = delete;
 
-    // Any thread, never blocks for long. The target URL is taken from the configuration now.
+    // Reports on `loop` from now on (again after stop()).
+    void start(EventLoop& loop);
+    // Any thread, never blocks for long; does nothing unless started. The target URL is
+    // taken from the configuration now.
     void notify();
-    // One throttled send on the calling thread (the waits end early on stop() or cancel());
-    // true when the list was posted and the PC suite answered.
+    // One send on the calling thread, without delay or throttle: the network and application
+    // tests, then the post. True when the list was posted and the PC suite answered.
     bool send(const std::string& url);
 
-    // True while a send runs (between taking the send lock and the end of the post).
-    bool getIsNotify() const { return m_isNotify.load(); }
-    void setIsNotify(bool is) { m_isNotify.store(is); }
-
-    // Drops a report that is waiting, ends throttle waits, and waits for a post in progress
-    // to finish. Later notify() calls work as before.
+    // Drops a report that is waiting and waits for a post in progress to finish. Later
+    // notify() calls work as before.
     void cancel();
-    // cancel(), then ends the reporter's thread for good; notify() does nothing afterwards.
+    // cancel(), and notify() does nothing until the next start().
     void stop();
     // Waits until no report is waiting or being sent; false at the time-out.
     bool waitIdle(std::chrono::milliseconds timeout);
 
 protected:
-    DeviceListReporter() = default;
+    DeviceListReporter();
 
     // The URL the list goes to, from the current configuration.
     virtual std::string reportUrl() const = 0;
@@ -61,26 +57,8 @@ protected:
     virtual void afterPost(const std::string& /*body*/) {}
 
 private:
-    using Steady = std::chrono::steady_clock;
-
-    void run();
-    bool sendRound(const std::string& url, std::uint64_t epoch);
-
-    std::atomic<bool> m_isNotify{false};
-    std::mutex lock;  // serialises sends of this reporter
-
-    // Everything below is guarded by state_.
-    std::mutex state_;
-    std::condition_variable changed_;
-    bool pending_ = false;            // a list is wanted that has not been built yet
-    Steady::time_point pendingSince_;
-    std::chrono::milliseconds pendingDelay_{0};
-    std::string pendingUrl_;
-    std::uint64_t epoch_ = 0;         // bumped by cancel(): waits of older rounds give up
-    bool stopping_ = false;
-    int sending_ = 0;                 // sends under way (worker or direct)
-    std::optional<Steady::time_point> lastTime;  // start of the previous send
-    std::thread worker_;
+    struct Core;
+    std::shared_ptr<Core> core_;
 };
 
 // The devices heard on the LAN, posted to "/SSDPQueryAll". Held by the service manager and

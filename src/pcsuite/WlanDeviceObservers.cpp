@@ -2,6 +2,7 @@
 
 #include <algorithm>
 
+#include "core/EventLoop.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "pcsuite/DeviceListReporter.h"
 
@@ -53,33 +54,22 @@ bool WlanDetectedDeviceCompare::checkWhetherDeviceChange(const SsdpDevice& devic
 
 // ---- WlanDeviceDelete -----------------------------------------------------------------------
 
-WlanDeviceDelete::WlanDeviceDelete() : WlanDeviceDelete(SsdpDeviceManager::instance()) {}
+WlanDeviceDelete::WlanDeviceDelete(EventLoop& loop) : WlanDeviceDelete(loop, SsdpDeviceManager::instance()) {}
 
-WlanDeviceDelete::WlanDeviceDelete(SsdpDeviceManager& manager) : manager_(manager) {}
+WlanDeviceDelete::WlanDeviceDelete(EventLoop& loop, SsdpDeviceManager& manager) : loop_(loop), manager_(manager) {}
 
 WlanDeviceDelete::~WlanDeviceDelete() { stop(); }
 
 void WlanDeviceDelete::detectedToDelete(std::chrono::milliseconds period) {
-    std::lock_guard<std::mutex> guard(stateLock_);
-    if (stopping_ || loop_.joinable()) return;
-    loop_ = std::thread([this, period] {
-        std::unique_lock<std::mutex> state(stateLock_);
-        while (!stopping_) {
-            state.unlock();
-            if (manager_.deleteDevices()) notifySubscribers();
-            state.lock();
-            wake_.wait_for(state, period, [this] { return stopping_; });
-        }
+    if (timer_) return;
+    timer_ = std::make_unique<PeriodicTimer>(loop_.context(), period, [this] {
+        if (manager_.deleteDevices()) notifySubscribers();
     });
+    timer_->start(std::chrono::milliseconds(0));
 }
 
 void WlanDeviceDelete::stop() {
-    {
-        std::lock_guard<std::mutex> guard(stateLock_);
-        stopping_ = true;
-    }
-    wake_.notify_all();
-    if (loop_.joinable() && loop_.get_id() != std::this_thread::get_id()) loop_.join();
+    if (timer_) loop_.call([this] { timer_->stop(); });
 }
 
 }  // namespace kesu

@@ -4,15 +4,16 @@
 #pragma once
 
 #include <chrono>
-#include <condition_variable>
 #include <cstddef>
 #include <memory>
 #include <mutex>
-#include <thread>
 #include <vector>
+
+#include "core/PeriodicTimer.h"
 
 namespace kesu {
 
+class EventLoop;
 class SsdpDevice;
 class SsdpDeviceManager;
 class WlanReportDevices;
@@ -55,25 +56,23 @@ private:
 
 class WlanDeviceDelete : public WlanReportObservers {
 public:
-    // Sweeps the table of SsdpDeviceManager::instance().
-    WlanDeviceDelete();
-    explicit WlanDeviceDelete(SsdpDeviceManager& manager);
+    // Sweeps the table of SsdpDeviceManager::instance() (or `manager`) on `loop`.
+    explicit WlanDeviceDelete(EventLoop& loop);
+    WlanDeviceDelete(EventLoop& loop, SsdpDeviceManager& manager);
     ~WlanDeviceDelete();  // stop()
     WlanDeviceDelete(const WlanDeviceDelete&) = delete;
     WlanDeviceDelete& operator=(const WlanDeviceDelete&) = delete;
 
-    // Starts the sweep loop on a thread of its own: sweep, notifySubscribers() when something
-    // was removed, wait `period`; until stop(). A second call does nothing.
+    // Starts the sweep, a timer on the loop: sweep now, notifySubscribers() when something
+    // was removed, again every `period`; until stop(). A second call does nothing.
     void detectedToDelete(std::chrono::milliseconds period);
-    // Ends the loop at once (its current sweep finishes first).
+    // No sweep runs after this returns.
     void stop();
 
 private:
+    EventLoop& loop_;
     SsdpDeviceManager& manager_;
-    std::mutex stateLock_;
-    std::condition_variable wake_;
-    bool stopping_ = false;
-    std::thread loop_;
+    std::unique_ptr<PeriodicTimer> timer_;
 };
 
 }  // namespace kesu

@@ -7,6 +7,7 @@
 #include <fstream>
 
 #include "control/HttpService.h"
+#include "core/EventLoop.h"
 #include "core/HttpAliveCheck.h"
 #include "core/RestartServiceSubscriber.h"
 #include "core/SingleInstance.h"
@@ -56,7 +57,8 @@ protected:
 };
 
 TEST_F(RestartRule, RestartsAfterMoreThanSevenWholeDaysOfAUsableVersionFile) {
-    RestartServiceSubscriber subscriber;
+    EventLoop loop;
+    RestartServiceSubscriber subscriber(loop);
     versionUpdated("2026-11-26 10:00:00.000");
     now("2026-12-03 10:00:00.000");  // exactly 7 days
     EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
@@ -87,21 +89,23 @@ TEST_F(RestartRule, OnlyLogOnWithoutConnectionTriggersTheCheck) {
     versionUpdated("2026-11-01 10:00:00.000");
     now("2026-12-04 10:00:00.000");
     Config::current().serviceExecutable = "/nonexistent/KesuConnService";
-    auto subscriber = std::make_shared<RestartServiceSubscriber>();
+    EventLoop loop;
+    loop.start();
+    auto subscriber = std::make_shared<RestartServiceSubscriber>(loop);
 
-    for (const char* other : {"LogOutEvent", "WifiOpenEvent", "PcsuiteEvent", "logonevent"}) subscriber->notify(other);
+    for (ServiceEvent other : {ServiceEvent::LogOut, ServiceEvent::WifiOpen, ServiceEvent::Pcsuite})
+        subscriber->notify(other);
     ASSERT_TRUE(subscriber->waitIdle(5s));
     Utils::closeLog();
     std::string log = test::readAll(Utils::logFilePath(Utils::now()));
     EXPECT_EQ(log.find("Now connservice run"), std::string::npos) << log;
 
     Utils::setIsCanConnectDevice(false);  // a connection in progress: no check
-    subscriber->notify("LogOnEvent");
+    subscriber->notify(ServiceEvent::LogOn);
     ASSERT_TRUE(subscriber->waitIdle(5s));
     Utils::closeLog();
     log = test::readAll(Utils::logFilePath(Utils::now()));
     EXPECT_EQ(log.find("restart KesuConnService"), std::string::npos) << log;
-    EXPECT_FALSE(subscriber->getIsNotify());
 }
 
 // The restart replaces the process image in place: the restarted program runs with the
@@ -130,14 +134,16 @@ TEST(Watchdog, RestartsAServerThatStoppedAnswering) {
     ASSERT_TRUE(HttpService::httpService().startHttpServic());
     EXPECT_TRUE(Utils::isHttpAlive());
 
-    HttpAliveCheck watchdog;  // the real probe: a HeartBeat to our own server
+    EventLoop loop;
+    loop.start();
+    HttpAliveCheck watchdog(loop);  // the real probe: a HeartBeat to our own server
     HttpService::httpService().stop();
     EXPECT_FALSE(Utils::isHttpAlive());
     ASSERT_TRUE(watchdog.waitForRestarts(1, 10s));
     EXPECT_TRUE(Utils::isHttpAlive());
     watchdog.stop();
     // A healthy server is left alone.
-    HttpAliveCheck quiet;
+    HttpAliveCheck quiet(loop);
     EXPECT_FALSE(quiet.waitForRestarts(1, 500ms));
     quiet.stop();
     HttpService::httpService().stop();

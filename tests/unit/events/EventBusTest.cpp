@@ -1,45 +1,44 @@
-// The event bus, the screen-lock watcher and the system subscriber against a stub PC suite.
+// The event bus (order, nothing lost while a subscriber is busy), the screen-lock watcher
+// and the system subscriber against a stub PC suite.
 #include <gtest/gtest.h>
 
 #include <condition_variable>
-#include <future>
 
+#include "core/EventLoop.h"
 #include "core/Json.h"
-#include "core/Utils.h"
 #include "events/EventDetected.h"
 #include "events/EventPublisher.h"
 #include "events/SystemEventSubscriber.h"
 #include "platform/fake/FakePlatform.h"
 #include "support/StubPcSuite.h"
 #include "support/TestSupport.h"
+#include "unit/events/EventRecorder.h"
 
 namespace kesu {
 namespace {
 
 using namespace std::chrono_literals;
+using Names = std::vector<std::string>;
 
-// Records the events it handles; a handler can be held open to make the subscriber busy.
-class RecordingSubscriber : public IEventSubscriber {
+// Records the events it handles on the pool; a handler can be held open to keep it busy.
+class HeldSubscriber : public IEventSubscriber {
 public:
-    explicit RecordingSubscriber(std::vector<std::string> names) : IEventSubscriber(std::move(names)) {}
-    bool eventNotify(const std::string& eventName) override {
+    HeldSubscriber(EventLoop& loop, EventSet events) : IEventSubscriber(loop, events) {}
+    void eventNotify(ServiceEvent event) override {
         std::unique_lock<std::mutex> l(m_);
-        seen_.push_back(eventName);
+        seen_.push_back(eventName(event));
         cv_.notify_all();
         cv_.wait(l, [this] { return !hold_; });
-        return true;
     }
     void hold(bool on) {
         std::lock_guard<std::mutex> l(m_);
         hold_ = on;
         cv_.notify_all();
     }
-    bool waitSeen(std::size_t n, std::chrono::milliseconds timeout) {
+    // The events handled so far, once there are at least `n` (or at the time-out).
+    Names seen(std::size_t n = 0) {
         std::unique_lock<std::mutex> l(m_);
-        return cv_.wait_for(l, timeout, [&] { return seen_.size() >= n; });
-    }
-    std::vector<std::string> seen() {
-        std::lock_guard<std::mutex> l(m_);
+        cv_.wait_for(l, 10s, [&] { return seen_.size() >= n; });
         return seen_;
     }
 
@@ -47,60 +46,75 @@ private:
     std::mutex m_;
     std::condition_variable cv_;
     bool hold_ = false;
-    std::vector<std::string> seen_;
+    Names seen_;
 };
 
 class EventBus : public ::testing::Test {
 protected:
+    void SetUp() override { loop.start(); }
     void TearDown() override { EventPublisher::instance().clearObservers(); }
+    static void publish(ServiceEvent event) { EventPublisher::instance().notifySubscribers(event); }
     test::HermeticEnv env;
+    EventLoop loop;
 };
 
-TEST_F(EventBus, BusySubscriberDropsEventsOthersStillGetThem) {
-    auto slow = std::make_shared<RecordingSubscriber>(std::vector<std::string>{"NetworkChangeEvent", "LogOnEvent"});
-    auto other = std::make_shared<RecordingSubscriber>(std::vector<std::string>{"NetworkChangeEvent"});
+// Nothing is lost while a handler is busy: later events wait, a kind pending again moves
+// behind the others (so the last state published is handled last), and the other
+// subscribers are not held up.
+TEST_F(EventBus, EventsArrivingWhileBusyAreKeptCoalescedAndDeliveredAfter) {
+    auto slow = std::make_shared<HeldSubscriber>(loop, EventSet{ServiceEvent::NetworkChange, ServiceEvent::LogOn,
+                                                                ServiceEvent::LogOut, ServiceEvent::AccountChange});
+    auto other = std::make_shared<HeldSubscriber>(loop, EventSet{ServiceEvent::WifiOpen});
     EventPublisher::instance().addObserver(slow);
     EventPublisher::instance().addObserver(other);
 
     slow->hold(true);
-    EventPublisher::instance().notifySubscribers("NetworkChangeEvent");
-    ASSERT_TRUE(slow->waitSeen(1, 5s));
-    ASSERT_TRUE(other->waitSeen(1, 5s));
-    ASSERT_TRUE(other->waitIdle(5s));
-    EventPublisher::instance().notifySubscribers("NetworkChangeEvent");  // slow is busy: dropped
-    EventPublisher::instance().notifySubscribers("WifiOpenEvent");       // nobody takes it
-    ASSERT_TRUE(other->waitSeen(2, 5s));
+    publish(ServiceEvent::LogOn);
+    ASSERT_EQ(slow->seen(1).size(), 1u);
+    for (ServiceEvent e : {ServiceEvent::AccountChange, ServiceEvent::LogOut, ServiceEvent::NetworkChange,
+                           ServiceEvent::NetworkChange, ServiceEvent::NetworkChange, ServiceEvent::LogOn,
+                           ServiceEvent::LogOut, ServiceEvent::WifiOpen})
+        publish(e);
+    ASSERT_EQ(other->seen(1).size(), 1u);
+    EXPECT_EQ(slow->seen(), Names{"LogOnEvent"});
     slow->hold(false);
-    ASSERT_TRUE(slow->waitIdle(5s));
-    ASSERT_TRUE(other->waitIdle(5s));
-    EventPublisher::instance().notifySubscribers("LogOnEvent");
-    ASSERT_TRUE(slow->waitSeen(2, 5s));
-    ASSERT_TRUE(slow->waitIdle(5s));
+    ASSERT_TRUE(slow->waitIdle(10s));
+    EXPECT_EQ(slow->seen(),
+              (Names{"LogOnEvent", "AccountChangeEvent", "NetworkChangeEvent", "LogOnEvent", "LogOutEvent"}));
 
-    EXPECT_EQ(slow->seen(), (std::vector<std::string>{"NetworkChangeEvent", "LogOnEvent"}));
-    EXPECT_EQ(other->seen(), (std::vector<std::string>{"NetworkChangeEvent", "NetworkChangeEvent"}));
+    // A stop drops what is pending and waits for the running handler, at most its time-out.
+    slow->hold(true);
+    publish(ServiceEvent::LogOn);
+    ASSERT_EQ(slow->seen(6).size(), 6u);
+    publish(ServiceEvent::AccountChange);
+    EXPECT_FALSE(slow->stop(50ms));
+    slow->hold(false);
+    EXPECT_TRUE(slow->stop(10s));
+    publish(ServiceEvent::LogOn);
+    EXPECT_TRUE(slow->waitIdle(10s));
+    EXPECT_EQ(slow->seen().size(), 6u);
+    EXPECT_EQ(other->seen(), Names{"WifiOpenEvent"});
 }
 
 TEST_F(EventBus, ScreenLockWatcherPublishesLogOutThenLogOn) {
     ScopedFakePlatform fake;
     env.config().screenLockPeriod = 20ms;
-    auto subscriber = std::make_shared<RecordingSubscriber>(std::vector<std::string>{"LogOnEvent", "LogOutEvent"});
-    EventPublisher::instance().addObserver(subscriber);
+    auto events = std::make_shared<test::EventRecorder>();
+    EventPublisher::instance().addObserver(events);
     {
-        EventDetected watcher;
+        EventDetected watcher(loop);
         fake->setScreenLocked(true);
-        ASSERT_TRUE(subscriber->waitSeen(1, 5s));
-        ASSERT_TRUE(subscriber->waitIdle(5s));
+        ASSERT_TRUE(events->waitFor("LogOutEvent", 1, 10s));
         fake->setScreenLocked(std::nullopt);  // unknown counts as unlocked
-        ASSERT_TRUE(subscriber->waitSeen(2, 5s));
-        ASSERT_TRUE(subscriber->waitIdle(5s));
+        ASSERT_TRUE(events->waitFor("LogOnEvent", 1, 10s));
     }
-    EXPECT_EQ(subscriber->seen(), (std::vector<std::string>{"LogOutEvent", "LogOnEvent"}));
+    EXPECT_EQ(events->events(), (Names{"LogOutEvent", "LogOnEvent"}));
 }
 
 class SystemEvents : public EventBus {
 protected:
     void SetUp() override {
+        EventBus::SetUp();
         pcsuite.pointPcsuiteHere(env.config());
         env.config().httpWaitTimeout = 5s;
     }
@@ -109,8 +123,8 @@ protected:
                                     : Json{{"isConnectBusy", false}};
         pcsuite.setAnswer("/isConnectBusy", {200, Json({{"code", "000000"}, {"data", data}}).dump()});
     }
-    void handle(const std::string& event) {
-        auto subscriber = std::make_shared<SystemEventSubscriber>();
+    void handle(ServiceEvent event) {
+        auto subscriber = std::make_shared<SystemEventSubscriber>(loop);
         subscriber->notify(event);
         ASSERT_TRUE(subscriber->waitIdle(10s));
     }
@@ -127,13 +141,13 @@ protected:
 
 TEST_F(SystemEvents, WiredLinkLostGetsABuryPointOnlyDuringAConnection) {
     busy(false);
-    handle("WiredNetDisconnectEvent");
+    handle(ServiceEvent::WiredNetDisconnect);
     EXPECT_EQ(bodiesTo("/notifySystemEvent"), std::vector<Json>{Json::object()});
     EXPECT_TRUE(pcsuite.requestsTo("/buryPoint").empty());
     EXPECT_EQ(pcsuite.requestsTo("/isConnectBusy").size(), 2u);  // both device kinds were asked about
 
     busy(true);
-    handle("WiredNetDisconnectEvent");
+    handle(ServiceEvent::WiredNetDisconnect);
     const auto bury = bodiesTo("/buryPoint");
     ASSERT_EQ(bury.size(), 1u);
     EXPECT_NE(bury[0].dump().find("W688|10308"), std::string::npos) << bury[0];
@@ -143,10 +157,10 @@ TEST_F(SystemEvents, WiredLinkLostGetsABuryPointOnlyDuringAConnection) {
 
 TEST_F(SystemEvents, LogOnAndWifiStatesArePosted) {
     busy(true);
-    handle("LogOutEvent");
-    handle("LogOnEvent");
-    handle("WifiOpenEvent");
-    handle("WifiCloseEvent");  // not this subscriber's
+    handle(ServiceEvent::LogOut);
+    handle(ServiceEvent::LogOn);
+    handle(ServiceEvent::WifiOpen);
+    handle(ServiceEvent::WifiClose);  // not this subscriber's
     EXPECT_EQ(bodiesTo("/notifySystemEvent"),
               (std::vector<Json>{{{"event", "LogOn"}, {"status", 0}},
                                  {{"event", "LogOn"}, {"status", 1}},

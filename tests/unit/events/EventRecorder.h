@@ -1,5 +1,5 @@
-// A bus subscriber for tests: records every published event name on the publisher's thread,
-// in order, so that a test can take them or wait for one.
+// A bus subscriber for tests: records the name of every published event on the publisher's
+// thread, in order, so that a test can take them or wait for one.
 #pragma once
 
 #include <algorithm>
@@ -18,12 +18,14 @@ class EventRecorder : public IEventSubscriber {
 public:
     using Events = std::vector<std::string>;
 
-    void notify(const std::string& eventName) override {
+    EventRecorder() : IEventSubscriber(EventSet{}) {}
+
+    void notify(ServiceEvent event) override {
         std::lock_guard<std::mutex> l(m_);
-        events_.push_back(eventName);
+        events_.push_back(eventName(event));
         cv_.notify_all();
     }
-    bool eventNotify(const std::string&) override { return false; }
+    void eventNotify(ServiceEvent) override {}
 
     // The events since the last take().
     Events events() {
