@@ -1,29 +1,31 @@
 // Pieces shared by the benchmarks: percentiles, a phone's announcement as it travels on the
-// LAN, and the real service started in a scratch HOME/KESU_ROOT with its control API client.
+// LAN, and the real service with its control API client, started in network namespaces by
+// the tests' own helpers (tests/support).
 #pragma once
 
-#include <fcntl.h>
 #include <httplib.h>
-#include <sched.h>
 #include <signal.h>
-#include <stdlib.h>
-#include <sys/wait.h>
 
 #include <algorithm>
 #include <cstdlib>
 #include <chrono>
 #include <cstdio>
-#include <filesystem>
+#include <exception>
+#include <fstream>
+#include <functional>
+#include <map>
+#include <memory>
 #include <optional>
 #include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "core/Json.h"
 #include "discovery/Base64.h"
-#include "support/PidNamespace.h"
-
-extern char** environ;
+#include "support/NetNs.h"
+#include "support/ServiceProcess.h"
+#include "support/TestSupport.h"
 
 namespace kesu::bench {
 
@@ -58,63 +60,35 @@ inline std::string controlBody(const std::string& event, const Json& args = Json
     return std::to_string(text.size()) + "#" + text;
 }
 
-inline bool shell(const std::string& cmd) { return std::system((cmd + " >/dev/null 2>&1").c_str()) == 0; }
-
-// Makes the network namespace `name` (loopback up) and moves the calling thread into it;
-// false when that is not allowed (not root). Call it while the process has one thread.
-inline bool enterNewNamespace(const std::string& name) {
-    shell("ip netns del " + name);
-    if (!shell("ip netns add " + name) || !shell("ip -n " + name + " link set lo up")) return false;
-    const int fd = ::open(("/run/netns/" + name).c_str(), O_RDONLY | O_CLOEXEC);
-    const bool entered = fd >= 0 && ::setns(fd, CLONE_NEWNET) == 0;
-    if (fd >= 0) ::close(fd);
-    return entered;
-}
-
-// The real service binary in the named network namespace (started through `ip netns exec`,
-// so that it sees that namespace's adapters) and in a PID namespace of its own (so that a
-// copy running on the machine does not make it stand down), its output discarded (or
-// written to $KESU_BENCH_LOG), HOME and KESU_ROOT in a scratch folder.
+// The real service binary, started the way the end-to-end tests start it: in the network
+// namespace `netns` and a PID namespace of its own (so that a copy running on the machine
+// does not make it stand down), HOME and KESU_ROOT in a scratch folder. Its output is
+// written to $KESU_BENCH_LOG when that is set.
 class BenchService {
 public:
     explicit BenchService(const std::string& netns) {
-        char pattern[] = "/tmp/kesu-bench-XXXXXX";
-        dir_ = ::mkdtemp(pattern);
-        std::filesystem::create_directories(dir_ + "/home");
-        std::filesystem::create_directories(dir_ + "/root");
-        std::vector<std::string> envs;
-        for (char** e = environ; *e; ++e) {
-            std::string s(*e);
-            if (s.rfind("HOME=", 0) != 0 && s.rfind("KESU_ROOT=", 0) != 0) envs.push_back(s);
+        try {
+            process_ = std::make_unique<test::ServiceProcess>(
+                KESU_BINARY, std::vector<std::string>{},
+                std::map<std::string, std::string>{{"HOME", dir_.str() + "/home"}, {"KESU_ROOT", dir_.str() + "/root"}},
+                netns, test::ServiceProcess::Pids::own);
+        } catch (const std::exception& e) {
+            std::fprintf(stderr, "%s\n", e.what());
         }
-        envs.push_back("HOME=" + dir_ + "/home");
-        envs.push_back("KESU_ROOT=" + dir_ + "/root");
-        std::vector<char*> cenv;
-        for (auto& e : envs) cenv.push_back(e.data());
-        cenv.push_back(nullptr);
-        const char* log = std::getenv("KESU_BENCH_LOG");
-        const int out = ::open(log ? log : "/dev/null", O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-        std::string ip = "/usr/sbin/ip", netnsWord = "netns", exec = "exec", ns = netns, binary = KESU_BINARY;
-        char* args[] = {ip.data(), netnsWord.data(), exec.data(), ns.data(), binary.data(), nullptr};
-        if (out >= 0) pid_ = test::spawnInPidNamespace(args, cenv.data(), out, -1);
-        if (out >= 0) ::close(out);
         client_.set_keep_alive(true);
         client_.set_tcp_nodelay(true);
         client_.set_read_timeout(std::chrono::seconds(60));
     }
     ~BenchService() {
-        if (pid_ > 0) {
-            ::kill(pid_, SIGTERM);
-            int status = 0;
-            ::waitpid(pid_, &status, 0);
-        }
-        std::filesystem::remove_all(dir_);
+        if (!process_) return;
+        process_->stop(SIGTERM, std::chrono::seconds(30));
+        if (const char* log = std::getenv("KESU_BENCH_LOG")) std::ofstream(log) << process_->output();
     }
-    pid_t pid() const { return pid_; }
+    pid_t pid() const { return process_ ? process_->pid() : -1; }
 
     // Waits (bounded, 10 s) until the control API answers.
     bool waitUntilUp() {
-        for (int i = 0; i < 100 && pid_ > 0; ++i) {
+        for (int i = 0; i < 100 && process_ && process_->running(); ++i) {
             if (control(controlBody("HeartBeat"))) return true;
             std::this_thread::sleep_for(std::chrono::milliseconds(100));
         }
@@ -128,9 +102,32 @@ public:
     }
 
 private:
-    std::string dir_;
-    pid_t pid_ = -1;
+    test::TempDir dir_;
+    std::unique_ptr<test::ServiceProcess> process_;
     httplib::Client client_{"127.0.0.1", 9197};
 };
+
+// Makes the lab `nodes` describe (names and hosts of an unbridged NetNsLab tagged "bench"),
+// then runs `body` with the nodes on a thread inside the first node's namespace, so that
+// the benchmark's own sockets (and the threads it starts) live beside the service. The exit
+// status of `body`, or 1 when the lab could not be made (it needs root).
+inline int runInLab(const char* bench, const std::vector<std::pair<std::string, int>>& nodes,
+                    const std::function<int(const std::vector<test::NetNsLab::Node>&)>& body) {
+    std::string why;
+    if (!test::NetNsLab::available(&why)) {
+        std::fprintf(stderr, "%s needs network namespaces: %s\n", bench, why.c_str());
+        return 1;
+    }
+    test::NetNsLab lab("bench", false);
+    std::vector<test::NetNsLab::Node> made;
+    for (const auto& [name, host] : nodes) made.push_back(lab.addNode(name, host));
+    if (!lab.ok()) {
+        std::fprintf(stderr, "%s: %s\n", bench, lab.error().c_str());
+        return 1;
+    }
+    int status = 1;
+    test::NetNsLab::runIn(made.front().ns, [&] { status = body(made); });
+    return status;
+}
 
 }  // namespace kesu::bench

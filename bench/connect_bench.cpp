@@ -1,5 +1,5 @@
 // Connections to a phone against the real binary, across a veth link between two network
-// namespaces (the service on 10.77.8.1, an in-process phone on 10.77.8.2):
+// namespaces (the service on one node, an in-process phone on the other):
 //  - connectSSDP round trip with a phone that accepts at once, next to a raw TCP exchange on
 //    the same link (connect, send a request-sized frame, read the echo, close) and the
 //    control API's HeartBeat, measured in the same run;
@@ -32,39 +32,16 @@ namespace {
 using namespace kesu::bench;
 using kesu::Json;
 
-const char* const kPhoneNs = "kesubench-phone";
-const char* const kPcIp = "10.77.8.1";
-const char* const kPhoneIp = "10.77.8.2";
+using kesu::test::NetNsLab;
+
 constexpr int kEchoPort = 10192;
-
-const char* const kPcNs = "kesubench-pc";
-
-// This process in a namespace of its own, joined to the phone's namespace by a veth pair.
-bool buildNetwork() {
-    shell(std::string("ip netns del ") + kPhoneNs);
-    const std::string n = std::string("ip -n ") + kPhoneNs + " ";
-    return enterNewNamespace(kPcNs) && shell(std::string("ip netns add ") + kPhoneNs) &&
-           shell(std::string("ip link add kb0 type veth peer name kb1 netns ") + kPhoneNs) &&
-           shell(std::string("ip addr add ") + kPcIp + "/24 dev kb0") && shell("ip link set kb0 up") &&
-           shell("ip route add 224.0.0.0/4 dev kb0") && shell(n + "link set lo up") &&
-           shell(n + "addr add " + kPhoneIp + "/24 dev kb1") && shell(n + "link set kb1 up") &&
-           shell(n + "route add 224.0.0.0/4 dev kb1");
-}
-
-// Runs `fn` on a thread that entered the phone's namespace (sockets made there stay there).
-void inPhoneNamespace(const std::function<void()>& fn) {
-    std::thread([&] {
-        const int fd = ::open((std::string("/run/netns/") + kPhoneNs).c_str(), O_RDONLY | O_CLOEXEC);
-        if (fd >= 0 && ::setns(fd, CLONE_NEWNET) == 0) fn();
-        if (fd >= 0) ::close(fd);
-    }).join();
-}
+std::string phoneIp;  // the phone node's address
 
 // Raw baseline: a new TCP link to the phone, one request-sized frame out and back, close.
 double rawExchange(const kesu::Bytes& frame) {
     const auto t0 = Clock::now();
     std::string error, echoed;
-    if (auto link = kesu::phonesim::Link::dial(kPhoneIp, kEchoPort, error); link && link->send(frame))
+    if (auto link = kesu::phonesim::Link::dial(phoneIp, kEchoPort, error); link && link->send(frame))
         link->read(echoed, std::chrono::seconds(5));
     return micros(Clock::now() - t0);
 }
@@ -79,21 +56,15 @@ void ratio(const char* what, const std::vector<double>& a, const std::vector<dou
                 percentile(a, 0.99) / percentile(b, 0.99));
 }
 
-}  // namespace
 
-int main(int argc, char** argv) {
-    const int connects = argc > 1 ? std::atoi(argv[1]) : 300;
-    const int announcements = argc > 2 ? std::atoi(argv[2]) : 100;
-    if (!buildNetwork()) {
-        std::fprintf(stderr, "connect_bench needs root for network namespaces\n");
-        return 1;
-    }
+int measure(const NetNsLab::Node& pc, const NetNsLab::Node& phoneNode, int connects, int announcements) {
+    phoneIp = phoneNode.ip;
     // The phone: accepts every connection request on 10191, echoes frames on the baseline port.
     std::unique_ptr<kesu::phonesim::Listener> phone, echo;
     int udp = -1;
-    inPhoneNamespace([&] {
+    NetNsLab::runIn(phoneNode.ns, [&] {
         kesu::phonesim::Listener::Options options;
-        options.host = kPhoneIp;
+        options.host = phoneIp;
         options.port = 10191;
         options.maxLinks = 64;
         phone = std::make_unique<kesu::phonesim::Listener>(options);
@@ -102,7 +73,7 @@ int main(int argc, char** argv) {
         echo = std::make_unique<kesu::phonesim::Listener>(options);
         udp = ::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
         in_addr iface{};
-        ::inet_pton(AF_INET, kPhoneIp, &iface);
+        ::inet_pton(AF_INET, phoneIp.c_str(), &iface);
         ::setsockopt(udp, IPPROTO_IP, IP_MULTICAST_IF, &iface, sizeof iface);
     });
     if (!phone || !echo || !phone->ok() || !echo->ok() || udp < 0) {
@@ -112,7 +83,7 @@ int main(int argc, char** argv) {
 
     int status = 1;
     {
-        BenchService service(kPcNs);
+        BenchService service(pc.ns);
         if (!service.waitUntilUp()) {
             std::fprintf(stderr, "service did not answer\n");
         } else {
@@ -192,7 +163,15 @@ int main(int argc, char** argv) {
     }
     phone.reset();
     echo.reset();
-    shell(std::string("ip netns del ") + kPhoneNs);
-    shell(std::string("ip netns del ") + kPcNs);
+    ::close(udp);
     return status;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    const int connects = argc > 1 ? std::atoi(argv[1]) : 300;
+    const int announcements = argc > 2 ? std::atoi(argv[2]) : 100;
+    return runInLab("connect_bench", {{"pc", 1}, {"phone", 2}},
+                    [&](const auto& nodes) { return measure(nodes[0], nodes[1], connects, announcements); });
 }

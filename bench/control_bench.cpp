@@ -186,17 +186,7 @@ long rssKiB(pid_t pid) {
 
 }  // namespace
 
-int main(int argc, char** argv) {
-    // The service announces itself on every adapter: run it in a network namespace of its
-    // own (loopback only) so that nothing leaves the machine.
-    const std::string netns = "kesubench-control";
-    if (!enterNewNamespace(netns)) {
-        std::fprintf(stderr, "control_bench needs root for a private network namespace\n");
-        return 1;
-    }
-    const int requests = argc > 1 ? std::atoi(argv[1]) : 2000;
-    const int idleSeconds = argc > 2 ? std::atoi(argv[2]) : 30;
-
+int measure(const std::string& netns, int requests, int idleSeconds) {
     BenchService service(netns);
     if (!service.waitUntilUp()) {
         std::fprintf(stderr, "service did not answer\n");
@@ -257,6 +247,13 @@ int main(int argc, char** argv) {
     std::printf("idle over %d s: CPU %.3f %%  RSS %ld KiB -> %ld KiB\n", idleSeconds,
                 100.0 * static_cast<double>(t1 - t0) / static_cast<double>(hz) / idleSeconds, rss0, rss1);
 
-    shell("ip netns del " + netns);
     return 0;
+}
+
+int main(int argc, char** argv) {
+    const int requests = argc > 1 ? std::atoi(argv[1]) : 2000;
+    const int idleSeconds = argc > 2 ? std::atoi(argv[2]) : 30;
+    // The service announces itself on every adapter: run it in a network namespace of its
+    // own (loopback only) so that nothing leaves the machine.
+    return runInLab("control_bench", {{"pc", 1}}, [&](const auto& nodes) { return measure(nodes[0].ns, requests, idleSeconds); });
 }

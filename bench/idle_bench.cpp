@@ -122,23 +122,11 @@ int main(int argc, char** argv) {
     const int seconds = std::max(1, option(argc, argv, "seconds", "KESU_IDLE_SECONDS", 60));
     const int settle = std::max(0, option(argc, argv, "settle", nullptr, 10));
 
-    const std::string netns = "kesubench-idle";
-    if (!enterNewNamespace(netns)) {
-        std::fprintf(stderr, "idle_bench needs root for a private network namespace\n");
-        return 1;
-    }
-    // One wired adapter with an address: the service keeps a socket on it and announces.
-    if (!shell("ip -n " + netns + " link add kib0 type veth peer name kib1") ||
-        !shell("ip -n " + netns + " addr add 10.77.0.1/24 dev kib0") ||
-        !shell("ip -n " + netns + " link set kib0 up") || !shell("ip -n " + netns + " link set kib1 up")) {
-        std::fprintf(stderr, "could not make the namespace's adapter\n");
-        shell("ip netns del " + netns);
-        return 1;
-    }
-
-    int rc = 0;
-    {
-        BenchService service(netns);
+    // One wired adapter with an address (a veth pair to a silent peer): the service keeps a
+    // socket on it and announces.
+    return runInLab("idle_bench", {{"pc", 1}, {"phone", 2}}, [&](const auto& nodes) {
+        int rc = 0;
+        BenchService service(nodes[0].ns);
         if (!service.waitUntilUp()) {
             std::fprintf(stderr, "service did not answer\n");
             rc = 1;
@@ -161,7 +149,6 @@ int main(int argc, char** argv) {
             for (const auto& [name, count] : last.names) std::printf(" %s x%d;", name.c_str(), count);
             std::printf("\n");
         }
-    }
-    shell("ip netns del " + netns);
-    return rc;
+        return rc;
+    });
 }

@@ -28,29 +28,13 @@ namespace {
 
 using namespace kesu::bench;
 
-const char* const kPcNs = "kesubench-rt-pc";
-const char* const kPhoneNs = "kesubench-rt-phone";
-const char* const kPhoneIp = "10.77.12.200";
+using kesu::test::NetNsLab;
 
-// This process in the PC's namespace, joined to the phone's namespace by a veth pair. The
-// PC's end (kr0) is up without an address: the service knows the adapter from its start.
-bool buildNetwork() {
-    shell(std::string("ip netns del ") + kPhoneNs);
-    const std::string n = std::string("ip -n ") + kPhoneNs + " ";
-    return enterNewNamespace(kPcNs) && shell(std::string("ip netns add ") + kPhoneNs) &&
-           shell(std::string("ip link add kr0 type veth peer name kr1 netns ") + kPhoneNs) &&
-           shell("ip link set kr0 up") && shell(n + "link set lo up") &&
-           shell(n + "addr add " + kPhoneIp + "/24 dev kr1") && shell(n + "link set kr1 up") &&
-           shell(n + "route add 224.0.0.0/4 dev kr1");
-}
-
-// The phone's listening socket: the discovery port, joined to the group on kr1.
-int phoneListener() {
+// The phone's listening socket in its namespace: the discovery port, joined to the group on
+// its veth end.
+int phoneListener(const std::string& phoneNs) {
     int fd = -1;
-    std::thread([&] {
-        const int ns = ::open((std::string("/run/netns/") + kPhoneNs).c_str(), O_RDONLY | O_CLOEXEC);
-        if (ns < 0 || ::setns(ns, CLONE_NEWNET) != 0) return;
-        ::close(ns);
+    NetNsLab::runIn(phoneNs, [&] {
         fd = ::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
         const int one = 1;
         ::setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
@@ -59,13 +43,13 @@ int phoneListener() {
         any.sin_port = htons(2200);
         ip_mreqn group{};
         ::inet_pton(AF_INET, "239.255.255.250", &group.imr_multiaddr);
-        group.imr_ifindex = static_cast<int>(if_nametoindex("kr1"));
+        group.imr_ifindex = static_cast<int>(if_nametoindex("veth0"));
         if (::bind(fd, reinterpret_cast<sockaddr*>(&any), sizeof any) != 0 ||
             ::setsockopt(fd, IPPROTO_IP, IP_ADD_MEMBERSHIP, &group, sizeof group) != 0) {
             ::close(fd);
             fd = -1;
         }
-    }).join();
+    });
     return fd;
 }
 
@@ -89,22 +73,21 @@ std::optional<Clock::time_point> awaitAnnouncement(int fd, const std::string& fr
     }
 }
 
-}  // namespace
 
-int main(int argc, char** argv) {
-    const int rounds = argc > 1 ? std::atoi(argv[1]) : 10;
-    if (!buildNetwork()) {
-        std::fprintf(stderr, "runtime_bench needs root for network namespaces\n");
+int measure(const std::string& pcNs, const std::string& phoneNs, int rounds) {
+    // The PC's end is up without an address: the service knows the adapter from its start.
+    if (!NetNsLab::ip("-n " + pcNs + " addr flush dev veth0")) {
+        std::fprintf(stderr, "could not clear the PC's address\n");
         return 1;
     }
-    const int phone = phoneListener();
+    const int phone = phoneListener(phoneNs);
     if (phone < 0) {
         std::fprintf(stderr, "the phone's socket could not be set up\n");
         return 1;
     }
     int status = 1;
     {
-        BenchService service(kPcNs);
+        BenchService service(pcNs);
         if (!service.waitUntilUp()) {
             std::fprintf(stderr, "service did not answer\n");
         } else {
@@ -113,11 +96,11 @@ int main(int argc, char** argv) {
             int missed = 0;
             for (int i = 0; i < rounds; ++i) {
                 // A new address each round (the previous one goes in the same change).
-                const std::string address = "10.77.12." + std::to_string(10 + i);
+                const std::string address = "10.77.0." + std::to_string(10 + i);
                 std::string batch = "printf '";
-                if (!previous.empty()) batch += "addr del " + previous + "/24 dev kr0\\n";
-                batch += "addr add " + address + "/24 dev kr0\\n' | ip -batch -";
-                if (!shell(batch)) {
+                if (!previous.empty()) batch += "addr del " + previous + "/24 dev veth0\\n";
+                batch += "addr add " + address + "/24 dev veth0\\n' | ip -n " + pcNs + " -batch - >/dev/null 2>&1";
+                if (std::system(batch.c_str()) != 0) {
                     std::fprintf(stderr, "could not add %s\n", address.c_str());
                     break;
                 }
@@ -143,7 +126,13 @@ int main(int argc, char** argv) {
         }
     }
     ::close(phone);
-    shell(std::string("ip netns del ") + kPhoneNs);
-    shell(std::string("ip netns del ") + kPcNs);
     return status;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    const int rounds = argc > 1 ? std::atoi(argv[1]) : 10;
+    return runInLab("runtime_bench", {{"pc", 1}, {"phone", 2}},
+                    [&](const auto& nodes) { return measure(nodes[0].ns, nodes[1].ns, rounds); });
 }

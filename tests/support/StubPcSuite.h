@@ -30,7 +30,6 @@ struct RecordedRequest {
     std::string body;
     std::chrono::steady_clock::time_point receivedAt;
 
-    bool hasHeader(const std::string& name) const { return headers.find(name) != headers.end(); }
     std::string header(const std::string& name) const;  // "" when absent
     std::string param(const std::string& name) const;   // "" when absent
 };
@@ -56,7 +55,6 @@ public:
     StubPcSuite& operator=(const StubPcSuite&) = delete;
 
     int port() const { return port_; }
-    bool isListening() const { return port_ > 0; }
     // "http://127.0.0.1:PORT/" (or https).
     std::string baseUrl() const;
     // Points the PC suite's host and port of `config` at this stub.

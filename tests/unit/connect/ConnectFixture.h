@@ -68,14 +68,14 @@ protected:
     EventLoop loop;  // started by the tests that need it; outlives what runs on it
 };
 
-// A listening socket on 127.0.0.1, an ephemeral port.
-inline int listenLoopback(int& port) {
+// A listening socket on 127.0.0.1, an ephemeral port, `backlog` pending connections.
+inline int listenLoopback(int& port, int backlog = 16) {
     const int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
     sockaddr_in addr{};
     addr.sin_family = AF_INET;
     addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
     ::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
-    ::listen(fd, 16);
+    ::listen(fd, backlog);
     socklen_t len = sizeof addr;
     ::getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len);
     port = ntohs(addr.sin_port);

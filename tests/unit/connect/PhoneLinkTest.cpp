@@ -135,15 +135,9 @@ TEST_F(PhoneLinkTest, ShutEndsWaitsAtOnce) {
     EXPECT_EQ(peerReads(1), "");  // the phone sees the link end
 
     // A connect to a listener whose queue is full waits for its deadline, or for a shut.
-    const int full = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    ::bind(full, reinterpret_cast<sockaddr*>(&address), sizeof address);
-    ::listen(full, 0);
-    socklen_t length = sizeof address;
-    ::getsockname(full, reinterpret_cast<sockaddr*>(&address), &length);
-    const auto port = ntohs(address.sin_port);
+    int fullPort = 0;
+    const int full = test::listenLoopback(fullPort, 0);
+    const auto port = static_cast<std::uint16_t>(fullPort);
     std::vector<std::unique_ptr<PhoneLink>> fillers;
     std::string error;
     for (int i = 0; i < 6 && error != "connect timed out"; ++i) {

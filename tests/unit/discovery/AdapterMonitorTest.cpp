@@ -2,14 +2,11 @@
 // coming, going, changing address and power, of a network on which the PC stops hearing
 // itself, the announcement pass on a real loopback socket, the rebuild pause as a timer,
 // and the discovery start-up's stop.
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sched.h>
 #include <unistd.h>
 
 #include <asio/steady_timer.hpp>
 #include <condition_variable>
-#include <functional>
 #include <future>
 #include <mutex>
 #include <thread>
@@ -17,12 +14,12 @@
 #include "DiscoveryFixture.h"
 #include "core/EventLoop.h"
 #include "core/Json.h"
-#include "core/Process.h"
 #include "discovery/Base64.h"
 #include "discovery/KesuAdapterManager.h"
 #include "discovery/ServiceWorker.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/SsdpMessage.h"
+#include "support/NetNs.h"
 #include "unit/events/EventRecorder.h"
 
 namespace kesu {
@@ -339,35 +336,24 @@ TEST_F(AdapterMonitor, ServiceWorkerStopsAtOnceAndStartsAfresh) {
 // A new address in a network namespace reaches the running discovery through the kernel's
 // change notification: announced on it long before the (here one hour) announce period.
 TEST_F(AdapterMonitor, KernelChangeNotificationTriggersACheckAtOnce) {
-    if (::geteuid() != 0) GTEST_SKIP() << "network namespaces need root";
-    const std::string ns = "kesu-lc-" + std::to_string(::getpid());
-    auto ip = [](const std::vector<std::string>& args) {
-        const auto r = process::run("ip", args, 10s);
-        return r && r->exitStatus == 0;
-    };
-    ASSERT_TRUE(ip({"netns", "add", ns}));
-    struct Cleanup {
-        std::function<void()> fn;
-        ~Cleanup() { fn(); }
-    } cleanup{[&] { ip({"netns", "del", ns}); }};
-    ASSERT_TRUE(ip({"-n", ns, "link", "set", "lo", "up"}));
+    if (!test::NetNsLab::available()) GTEST_SKIP() << "network namespaces need root";
+    test::NetNsLab lab("lc" + std::to_string(::getpid()), false);
+    const std::string ns = lab.addNode("pc", 1).ns;  // loopback only
+    ASSERT_TRUE(lab.ok()) << lab.error();
     env.config().ssdpAnnouncePeriod = std::chrono::hours(1);
     fake->setWifiPowerOn(true);
     network({});
 
     ServiceWorker worker(loop, devices);
-    std::thread([&] {  // the worker's sockets and listener open in the namespace
-        const int fd = ::open(("/run/netns/" + ns).c_str(), O_RDONLY | O_CLOEXEC);
-        if (fd >= 0 && ::setns(fd, CLONE_NEWNET) == 0) worker.start();
-        if (fd >= 0) ::close(fd);
-    }).join();
+    // The worker's sockets and listener open in the namespace.
+    ASSERT_TRUE(test::NetNsLab::runIn(ns, [&] { worker.start(); }));
     ASSERT_TRUE(worker.isRunning());
     ASSERT_TRUE(events->waitFor("WifiOpenEvent", 1, 10s));  // the first pass is over
     ASSERT_TRUE(worker.adapters()->socketInterfaces().empty());
 
     // The fake platform reports the adapter; the kernel's notification says when to look.
     network({{"Ethernet", "kf-lc0", "10.77.9.1"}});
-    ASSERT_TRUE(ip({"-n", ns, "link", "add", "kf-lc0", "type", "veth", "peer", "name", "kf-lc1"}));
+    ASSERT_TRUE(test::NetNsLab::ip("-n " + ns + " link add kf-lc0 type veth peer name kf-lc1"));
     ASSERT_TRUE(events->waitFor("WiredNetConnectEvent", 1, 10s));
     EXPECT_EQ(worker.adapters()->socketInterfaces(), (Names{"kf-lc0"}));
     worker.stop();

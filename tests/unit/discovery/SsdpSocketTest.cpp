@@ -2,10 +2,8 @@
 // the device table and the control API's SSDPQueryAll, the PC hearing itself, oversized and
 // empty datagrams, failed set-up, close and rebuild), and across network namespaces (one
 // socket per adapter hears and speaks only on its own network).
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <net/if.h>
-#include <sched.h>
 
 #include <condition_variable>
 #include <future>
@@ -15,12 +13,12 @@
 
 #include "DiscoveryFixture.h"
 #include "core/EventLoop.h"
-#include "core/Process.h"
 #include "discovery/KesuAdapterManager.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/SsdpMessage.h"
 #include "discovery/SsdpSocket.h"
 #include "discovery/SsdpSocketManager.h"
+#include "support/NetNs.h"
 
 namespace kesu {
 namespace {
@@ -230,42 +228,24 @@ TEST_F(SsdpSocketTest, SharedPortRebuildsAndCloseFromAnyThread) {
 // and the PC's first adapter have a multicast route. Everything is removed at the end.
 class NetnsLab {
 public:
-    NetnsLab() : prefix_("kesu-f-" + std::to_string(::getpid())) {}
     ~NetnsLab() {
-        for (const char* role : {"pc", "pa", "pb"}) ip({"netns", "del", ns(role)});
+        for (const char* role : {"pc", "pa", "pb"}) test::NetNsLab::ip("netns del " + ns(role));
     }
-    std::string ns(const std::string& role) const { return prefix_ + "-" + role; }
+    std::string ns(const std::string& role) const { return "kesu-f-" + std::to_string(::getpid()) + "-" + role; }
 
     // Empty when the lab is up, else what failed.
     std::string up() {
-        const std::string pc = ns("pc"), pa = ns("pa"), pb = ns("pb");
-        const std::vector<std::vector<std::string>> steps = {
-            {"netns", "add", pc},
-            {"netns", "add", pa},
-            {"netns", "add", pb},
-            {"-n", pc, "link", "set", "lo", "up"},
-            {"-n", pa, "link", "set", "lo", "up"},
-            {"-n", pb, "link", "set", "lo", "up"},
-            {"-n", pc, "link", "add", "kf-a0", "type", "veth", "peer", "name", "kf-a1", "netns", pa},
-            {"-n", pc, "link", "add", "kf-b0", "type", "veth", "peer", "name", "kf-b1", "netns", pb},
-            {"-n", pc, "addr", "add", "10.77.0.1/30", "dev", "kf-a0"},
-            {"-n", pc, "addr", "add", "10.77.0.5/30", "dev", "kf-b0"},
-            {"-n", pa, "addr", "add", "10.77.0.2/30", "dev", "kf-a1"},
-            {"-n", pb, "addr", "add", "10.77.0.6/30", "dev", "kf-b1"},
-            {"-n", pc, "link", "set", "kf-a0", "up"},
-            {"-n", pc, "link", "set", "kf-b0", "up"},
-            {"-n", pa, "link", "set", "kf-a1", "up"},
-            {"-n", pb, "link", "set", "kf-b1", "up"},
-            {"-n", pc, "route", "add", "224.0.0.0/4", "dev", "kf-a0"},
-            {"-n", pa, "route", "add", "224.0.0.0/4", "dev", "kf-a1"},
-            {"-n", pb, "route", "add", "224.0.0.0/4", "dev", "kf-b1"},
-        };
-        for (const auto& step : steps) {
-            if (!ip(step)) {
-                std::string text = "ip";
-                for (const auto& arg : step) text += " " + arg;
-                return text + " failed";
-            }
+        const std::string pc = "-n " + ns("pc") + " ", pa = "-n " + ns("pa") + " ", pb = "-n " + ns("pb") + " ";
+        for (const std::string& step :
+             {"netns add " + ns("pc"), "netns add " + ns("pa"), "netns add " + ns("pb"), pc + "link set lo up",
+              pa + "link set lo up", pb + "link set lo up",
+              pc + "link add kf-a0 type veth peer name kf-a1 netns " + ns("pa"),
+              pc + "link add kf-b0 type veth peer name kf-b1 netns " + ns("pb"), pc + "addr add 10.77.0.1/30 dev kf-a0",
+              pc + "addr add 10.77.0.5/30 dev kf-b0", pa + "addr add 10.77.0.2/30 dev kf-a1",
+              pb + "addr add 10.77.0.6/30 dev kf-b1", pc + "link set kf-a0 up", pc + "link set kf-b0 up",
+              pa + "link set kf-a1 up", pb + "link set kf-b1 up", pc + "route add 224.0.0.0/4 dev kf-a0",
+              pa + "route add 224.0.0.0/4 dev kf-a1", pb + "route add 224.0.0.0/4 dev kf-b1"}) {
+            if (!test::NetNsLab::ip(step)) return "ip " + step + " failed";
         }
         return "";
     }
@@ -274,22 +254,9 @@ public:
     template <class F>
     auto inside(const std::string& role, F make) -> decltype(make()) {
         decltype(make()) made{};
-        std::thread([&] {
-            const int fd = ::open(("/run/netns/" + ns(role)).c_str(), O_RDONLY | O_CLOEXEC);
-            if (fd < 0) return;
-            const bool entered = ::setns(fd, CLONE_NEWNET) == 0;
-            ::close(fd);
-            if (entered) made = make();
-        }).join();
+        test::NetNsLab::runIn(ns(role), [&] { made = make(); });
         return made;
     }
-
-private:
-    static bool ip(const std::vector<std::string>& args) {
-        const auto result = process::run("ip", args, 10s);
-        return result && result->exitStatus == 0;
-    }
-    std::string prefix_;
 };
 
 TEST_F(SsdpSocketTest, NetnsEachAdapterSocketHearsAndSpeaksOnlyOnItsOwnNetwork) {
