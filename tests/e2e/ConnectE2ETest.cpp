@@ -3,6 +3,8 @@
 // stand-ins for the allow window and the PC suite. Needs root and `ip netns`.
 #include <gtest/gtest.h>
 
+#include <future>
+
 #include <map>
 #include <nlohmann/json.hpp>
 #include <regex>
@@ -97,11 +99,10 @@ TEST_F(ConnectE2E, SilentPhoneTimesOutAndASecondAttemptIsBusy) {
     auto service = startService();
     auto sim = answeringPhone(phone, "SIL1", "silent", *service);
 
-    json first;
-    std::thread waiting([&] { first = control(pc.ns, "connectSSDP", {hexId("SIL1")}); });
+    auto waiting = std::async(std::launch::async, [&] { return control(pc.ns, "connectSSDP", {hexId("SIL1")}); });
     ASSERT_TRUE(sim->waitForOutput("SIM TCP_REQUEST", 10s)) << sim->output();
     const json second = control(pc.ns, "connectSSDP", {hexId("SIL1")});
-    waiting.join();
+    const json first = waiting.get();
 
     EXPECT_EQ(second["error"], -10001) << second;
     EXPECT_EQ(second["connection_steps"], "_WI:-1") << second;
