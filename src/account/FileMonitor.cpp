@@ -219,13 +219,24 @@ void FileMonitor::tick() {
             passes->again = true;
             return;
         }
+    }
+    // The file's identity is quick to take; only a read of the database goes to the pool.
+    Read read = Read::None;
+    try {
+        read = inspect();
+    } catch (const std::exception& e) {
+        Utils::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
+    }
+    if (read == Read::None) return;
+    {
+        std::lock_guard<std::mutex> lock(passes->mutex);
         passes->underWay = true;
     }
     std::weak_ptr<PeriodicTimer> timer = timer_;
     loop_.offload(
-        [this, passes] {
+        [this, passes, read] {
             try {
-                runPass();
+                readFile(read);
             } catch (const std::exception& e) {
                 // One bad pass must not end the watch.
                 Utils::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
@@ -251,6 +262,11 @@ std::optional<DatabaseState> FileMonitor::state() const {
 }
 
 void FileMonitor::runPass() {
+    const Read read = inspect();
+    if (read != Read::None) readFile(read);
+}
+
+FileMonitor::Read FileMonitor::inspect() {
     const std::string path = databaseFilePath_ + "/" + kDatabaseFile;
     const auto identity = fileIdentity(path);
     if (!identity) {
@@ -260,7 +276,7 @@ void FileMonitor::runPass() {
             // is read again once it can be examined.
             lastIdentity_.reset();
             enterState(DatabaseState::Unreadable, std::strerror(error));
-            return;
+            return Read::None;
         }
         dataInstance().update([](databaseParam& p) {
             p.openid.clear();
@@ -271,17 +287,20 @@ void FileMonitor::runPass() {
         });
         lastIdentity_.reset();
         enterState(DatabaseState::Missing, {});
-        return;
+        return Read::None;
     }
     // A file back after a loss, or another file renamed over it, is read even when it keeps
     // the modification time of the last one.
     const bool timeChanged = fileAttributeGet(databaseFilePath_, lastModifyTime, firstRead, databaseReadTimes);
     if (timeChanged || identity != lastIdentity_) {
         lastIdentity_ = identity;
-        readAndAnnounce();
-        return;
+        return Read::Changed;
     }
-    if (state() != DatabaseState::Busy) return;
+    return state() == DatabaseState::Busy ? Read::Retry : Read::None;
+}
+
+void FileMonitor::readFile(Read read) {
+    if (read == Read::Changed) return readAndAnnounce();
     // The last read found the file locked: try again, quietly unless that changes something.
     const DatabaseReadResult result = readAccountDatabase(databaseFilePath_);
     if (result.state == DatabaseState::Busy) return;

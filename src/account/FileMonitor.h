@@ -6,8 +6,9 @@
 // tried again on the next pass until it gets through.
 // The pass runs every period on the event loop's timer and at once (after a short settling
 // delay) when inotify reports a change in the database's folder, or in its nearest existing
-// ancestor while the folder does not exist yet. The pass itself (stat, SQLite read, which may
-// wait for a writer's lock) runs on the loop's worker pool, one at a time.
+// ancestor while the folder does not exist yet. The file's identity is taken on the loop; a
+// read of the database (which may wait for a writer's lock) runs on the loop's worker pool,
+// one at a time.
 #pragma once
 
 #include <atomic>
@@ -44,7 +45,7 @@ public:
     void stop();
     bool running() const;
 
-    // One pass. Runs on the worker pool; tests call it directly instead of starting the watch
+    // One pass, inspection and read. Tests call it directly instead of starting the watch
     // (never both).
     void runPass();
 
@@ -77,7 +78,13 @@ private:
     struct Watch;
     struct Passes;
 
-    // Loop: starts a pass on the pool unless one is under way (then one more follows it).
+    enum class Read { None, Changed, Retry };
+    // The first half of a pass: the file's identity and what it asks for.
+    Read inspect();
+    // The second half, which may wait for the database's lock.
+    void readFile(Read read);
+    // Loop: inspects the file and reads it on the pool unless a read is under way (then one
+    // more pass follows it).
     void tick();
     void readAndAnnounce();
     // Records the state and logs it when it differs from the last one.
@@ -88,7 +95,8 @@ private:
     const std::string databaseFilePath_;
     const int pushClientPort_;
 
-    // State of the passes; touched only by the one pass under way.
+    // State of the passes; touched by one pass at a time (its inspection on the loop, its
+    // read on the pool).
     TimePoint lastModifyTime;
     bool firstRead = true;
     int databaseReadTimes = 0;

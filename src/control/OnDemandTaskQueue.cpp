@@ -39,8 +39,11 @@ void OnDemandTaskQueue::work(std::list<std::thread>::iterator self) {
     std::unique_lock<std::mutex> lock(mutex_);
     for (;;) {
         ++idle_;
-        const bool woken =
-            jobReady_.wait_for(lock, idleTimeout_, [this] { return shutdown_ || !jobs_.empty(); });
+        const auto ready = [this] { return shutdown_ || !jobs_.empty(); };
+        // A worker that would stay anyway waits without waking up.
+        bool woken = true;
+        if (alive_ > keep_) woken = jobReady_.wait_for(lock, idleTimeout_, ready);
+        else jobReady_.wait(lock, ready);
         --idle_;
         if (!jobs_.empty()) {
             std::function<void()> fn = std::move(jobs_.front());
