@@ -1,6 +1,7 @@
 #include "control/HttpService.h"
 
 #include <httplib.h>
+#include <pthread.h>
 #include <sys/socket.h>
 
 #include <cstdio>
@@ -95,6 +96,7 @@ bool HttpService::startHttpServic() {
     auto ended = std::make_shared<std::promise<void>>();
     listenerEnded_ = ended->get_future();
     listener_ = std::thread([raw, ended] {
+        pthread_setname_np(pthread_self(), "kesu-listen");
         raw->listen_after_bind();
         ended->set_value();
     });
