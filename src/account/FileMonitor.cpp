@@ -1,22 +1,33 @@
-// The modification-time poll of Config.db and what a change sets off.
+// The watch on Config.db and what a change sets off.
 #include "account/FileMonitor.h"
 
 #include <fcntl.h>
+#include <sys/inotify.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <asio/buffer.hpp>
+#include <asio/posix/stream_descriptor.hpp>
+#include <asio/steady_timer.hpp>
+
+#include <array>
 #include <cerrno>
 #include <cstring>
 #include <ctime>
 #include <filesystem>
+#include <functional>
 #include <memory>
 #include <optional>
+#include <string_view>
+#include <utility>
 
 #include "account/DataGet.h"
 #include "account/DataInstance.h"
 #include "connect/UdpSocketBase.h"
 #include "core/Config.h"
+#include "core/EventLoop.h"
 #include "core/Json.h"
+#include "core/PeriodicTimer.h"
 #include "core/Utils.h"
 #include "events/EventPublisher.h"
 
@@ -25,6 +36,8 @@ namespace kesu {
 namespace {
 
 const std::string kDatabaseFile = "Config.db";
+// Events come in bursts (a write, the journal, a rename): one pass once they have settled.
+constexpr std::chrono::milliseconds kSettle{100};
 
 // Modification time of the file; nullopt (with errno set) when it cannot be examined.
 std::optional<FileMonitor::TimePoint> modificationTime(const std::string& path) {
@@ -36,55 +49,211 @@ std::optional<FileMonitor::TimePoint> modificationTime(const std::string& path) 
 
 }  // namespace
 
-FileMonitor::FileMonitor(std::string databaseFilePath)
-    : databaseFilePath_(std::move(databaseFilePath)),
-      period_(Config::current().fileMonitorPeriod),
+// The inotify watch on the database's folder, or on its nearest existing ancestor while the
+// folder is missing (re-armed lower as folders appear, higher when the folder goes). Every
+// change that may concern Config.db calls `changed` once the events have settled.
+struct FileMonitor::Watch : std::enable_shared_from_this<Watch> {
+    Watch(asio::io_context& io, std::string f, std::function<void()> c)
+        : descriptor(io), settle(io), folder(std::move(f)), changed(std::move(c)) {}
+
+    // Loop only, from here on.
+    void open() {
+        const int fd = ::inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
+        if (fd < 0) {
+            Utils::mPrintlog(std::string("[fileMonitorStart] no change notification (") + std::strerror(errno) +
+                             "), the database is checked every period only");
+            return;
+        }
+        descriptor.assign(fd);
+        arm();
+        read();
+    }
+    void close() {
+        closed = true;
+        settle.cancel();
+        std::error_code ignored;
+        descriptor.close(ignored);
+    }
+
+    void arm() {
+        const int fd = descriptor.native_handle();
+        if (wd >= 0) ::inotify_rm_watch(fd, wd);
+        std::filesystem::path dir(folder);
+        std::error_code error;
+        watchingFolder = true;
+        while (!std::filesystem::is_directory(dir, error)) {
+            const std::filesystem::path parent = dir.parent_path();
+            watchingFolder = false;
+            if (parent.empty()) {
+                dir = ".";
+                break;
+            }
+            if (parent == dir) break;
+            dir = parent;
+        }
+        const std::uint32_t mask =
+            watchingFolder ? (IN_CREATE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE | IN_MODIFY | IN_CLOSE_WRITE |
+                              IN_ATTRIB | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR)
+                           : (IN_CREATE | IN_MOVED_TO | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR);
+        wd = ::inotify_add_watch(fd, dir.c_str(), mask);
+    }
+    void read() {
+        descriptor.async_read_some(asio::buffer(buffer), [self = shared_from_this()](const std::error_code& error,
+                                                                                     std::size_t size) {
+            if (error || self->closed) return;
+            self->handle(size);
+            self->read();
+        });
+    }
+    void handle(std::size_t size) {
+        bool relevant = false, rearm = false;
+        for (std::size_t at = 0; at + sizeof(inotify_event) <= size;) {
+            inotify_event event{};
+            std::memcpy(&event, buffer.data() + at, sizeof event);
+            const std::string_view name =
+                event.len ? std::string_view(buffer.data() + at + sizeof event) : std::string_view();
+            at += sizeof event + event.len;
+            if (event.mask & IN_Q_OVERFLOW) {
+                relevant = rearm = true;
+                continue;
+            }
+            if (event.wd != wd) continue;  // left over from an earlier watch
+            if (event.mask & (IN_IGNORED | IN_DELETE_SELF | IN_MOVE_SELF)) {
+                relevant = rearm = true;
+            } else if (!watchingFolder) {
+                relevant = rearm = true;  // a folder on the way may have appeared
+            } else if (name.starts_with(kDatabaseFile)) {
+                relevant = true;  // the file, or its journal coming and going
+            }
+        }
+        if (rearm) arm();
+        if (relevant && !settling) {
+            settling = true;
+            settle.expires_after(kSettle);
+            settle.async_wait([self = shared_from_this()](const std::error_code& error) {
+                self->settling = false;
+                if (!error && !self->closed) self->changed();
+            });
+        }
+    }
+
+    asio::posix::stream_descriptor descriptor;
+    asio::steady_timer settle;
+    const std::string folder;
+    const std::function<void()> changed;
+    alignas(inotify_event) std::array<char, 4096> buffer{};
+    int wd = -1;
+    bool watchingFolder = false;
+    bool settling = false;
+    bool closed = false;
+};
+
+// Whether a pass is under way; shared with it, so that its hand-back is safe after the stop.
+struct FileMonitor::Passes {
+    std::mutex mutex;
+    std::condition_variable ended;
+    bool underWay = false;
+    bool again = false;  // a check was asked for while one was under way
+    bool stopped = false;
+};
+
+FileMonitor::FileMonitor(EventLoop& loop, std::string databaseFilePath)
+    : loop_(loop),
+      databaseFilePath_(std::move(databaseFilePath)),
       pushClientPort_(Config::current().pushClientUdpPort),
-      lastModifyTime(Utils::now()) {}
+      lastModifyTime(Utils::now()),
+      passes_(std::make_shared<Passes>()),
+      timer_(std::make_shared<PeriodicTimer>(loop.context(), [] { return Config::current().fileMonitorPeriod; },
+                                             [this] { tick(); })) {}
 
 FileMonitor::~FileMonitor() { stop(); }
 
 bool FileMonitor::start() {
     std::lock_guard<std::mutex> lifecycle(lifecycle_);
-    std::lock_guard<std::mutex> lock(mutex_);
-    if (thread_.joinable()) return false;
-    stopping_ = false;
-    thread_ = std::thread([this] { loop(); });
+    if (running_) return false;
+    running_ = true;
+    {
+        std::lock_guard<std::mutex> lock(passes_->mutex);
+        passes_->stopped = false;
+        passes_->again = false;
+    }
+    std::weak_ptr<PeriodicTimer> timer = timer_;
+    loop_.call([this, timer] {
+        watch_ = std::make_shared<Watch>(loop_.context(), databaseFilePath_, [timer] {
+            if (auto t = timer.lock()) t->runNow();
+        });
+        watch_->open();
+    });
+    timer_->start(std::chrono::milliseconds(0));
     return true;
 }
 
 void FileMonitor::stop() {
-    // Held until the old thread is gone, so that a start() cannot revive its loop.
     std::lock_guard<std::mutex> lifecycle(lifecycle_);
-    std::thread thread;
+    if (!running_) return;
+    running_ = false;
+    timer_->stop();
     {
-        std::lock_guard<std::mutex> lock(mutex_);
-        stopping_ = true;
-        thread = std::move(thread_);
+        std::lock_guard<std::mutex> lock(passes_->mutex);
+        passes_->stopped = true;
     }
-    wake_.notify_all();
-    if (thread.joinable() && thread.get_id() != std::this_thread::get_id()) thread.join();
-    else if (thread.joinable()) thread.detach();
+    // On the loop: a tick running there has finished once this returns.
+    loop_.call([this] {
+        if (watch_) watch_->close();
+        watch_.reset();
+    });
+    // A pass gives up after the database's busy wait.
+    std::unique_lock<std::mutex> lock(passes_->mutex);
+    passes_->ended.wait_for(lock, Config::current().databaseBusyTimeout + std::chrono::seconds(10),
+                            [this] { return !passes_->underWay; });
 }
 
-bool FileMonitor::running() const {
-    std::lock_guard<std::mutex> lock(mutex_);
-    return thread_.joinable() && !stopping_;
-}
+bool FileMonitor::running() const { return running_; }
 
-void FileMonitor::loop() {
-    std::unique_lock<std::mutex> lock(mutex_);
-    while (!stopping_) {
-        lock.unlock();
-        try {
-            runPass();
-        } catch (const std::exception& e) {
-            // One bad pass must not end the watch.
-            Utils::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
+void FileMonitor::tick() {
+    const std::shared_ptr<Passes> passes = passes_;
+    {
+        std::lock_guard<std::mutex> lock(passes->mutex);
+        if (passes->stopped) return;
+        if (passes->underWay) {
+            passes->again = true;
+            return;
         }
-        lock.lock();
-        wake_.wait_for(lock, period_, [this] { return stopping_; });
     }
+    // The file's identity is quick to take; only a read of the database goes to the pool.
+    Read read = Read::None;
+    try {
+        read = inspect();
+    } catch (const std::exception& e) {
+        Utils::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
+    }
+    if (read == Read::None) return;
+    {
+        std::lock_guard<std::mutex> lock(passes->mutex);
+        passes->underWay = true;
+    }
+    std::weak_ptr<PeriodicTimer> timer = timer_;
+    loop_.offload(
+        [this, passes, read] {
+            try {
+                readFile(read);
+            } catch (const std::exception& e) {
+                // One bad pass must not end the watch.
+                Utils::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
+            }
+            std::lock_guard<std::mutex> lock(passes->mutex);
+            passes->underWay = false;
+            passes->ended.notify_all();
+        },
+        [passes, timer] {
+            bool again = false;
+            {
+                std::lock_guard<std::mutex> lock(passes->mutex);
+                again = std::exchange(passes->again, false) && !passes->stopped;
+            }
+            if (again)
+                if (auto t = timer.lock()) t->runNow();
+        });
 }
 
 std::optional<DatabaseState> FileMonitor::state() const {
@@ -93,6 +262,11 @@ std::optional<DatabaseState> FileMonitor::state() const {
 }
 
 void FileMonitor::runPass() {
+    const Read read = inspect();
+    if (read != Read::None) readFile(read);
+}
+
+FileMonitor::Read FileMonitor::inspect() {
     const std::string path = databaseFilePath_ + "/" + kDatabaseFile;
     const auto identity = fileIdentity(path);
     if (!identity) {
@@ -102,7 +276,7 @@ void FileMonitor::runPass() {
             // is read again once it can be examined.
             lastIdentity_.reset();
             enterState(DatabaseState::Unreadable, std::strerror(error));
-            return;
+            return Read::None;
         }
         dataInstance().update([](databaseParam& p) {
             p.openid.clear();
@@ -113,17 +287,20 @@ void FileMonitor::runPass() {
         });
         lastIdentity_.reset();
         enterState(DatabaseState::Missing, {});
-        return;
+        return Read::None;
     }
     // A file back after a loss, or another file renamed over it, is read even when it keeps
     // the modification time of the last one.
     const bool timeChanged = fileAttributeGet(databaseFilePath_, lastModifyTime, firstRead, databaseReadTimes);
     if (timeChanged || identity != lastIdentity_) {
         lastIdentity_ = identity;
-        readAndAnnounce();
-        return;
+        return Read::Changed;
     }
-    if (state() != DatabaseState::Busy) return;
+    return state() == DatabaseState::Busy ? Read::Retry : Read::None;
+}
+
+void FileMonitor::readFile(Read read) {
+    if (read == Read::Changed) return readAndAnnounce();
     // The last read found the file locked: try again, quietly unless that changes something.
     const DatabaseReadResult result = readAccountDatabase(databaseFilePath_);
     if (result.state == DatabaseState::Busy) return;
@@ -262,7 +439,7 @@ ProcessMonitor& processMonitor() {
 
 }  // namespace
 
-bool fileMonitorStart() {
+bool fileMonitorStart(EventLoop& loop) {
     std::string databaseDir;
     FilePathget(databaseDir);
     {
@@ -273,7 +450,7 @@ bool fileMonitorStart() {
             return false;
         }
         // A stopped monitor has joined its thread and can go.
-        holder.monitor = std::make_unique<FileMonitor>(databaseDir);
+        holder.monitor = std::make_unique<FileMonitor>(loop, databaseDir);
         holder.monitor->start();
     }
     getPcsuiteDeviceInfo();
@@ -281,9 +458,13 @@ bool fileMonitorStart() {
 }
 
 void fileMonitorStop() {
-    ProcessMonitor& holder = processMonitor();
-    std::lock_guard<std::mutex> lock(holder.mutex);
-    if (holder.monitor) holder.monitor->stop();
+    std::unique_ptr<FileMonitor> monitor;
+    {
+        ProcessMonitor& holder = processMonitor();
+        std::lock_guard<std::mutex> lock(holder.mutex);
+        monitor = std::move(holder.monitor);
+    }
+    monitor.reset();  // stops it
 }
 
 }  // namespace kesu

@@ -4,39 +4,49 @@
 // publishes "AccountChangeEvent". The file's state (missing, unreadable, busy, good) is
 // logged once per change of state, not on every pass; a read that found the file locked is
 // tried again on the next pass until it gets through.
+// The pass runs every period on the event loop's timer and at once (after a short settling
+// delay) when inotify reports a change in the database's folder, or in its nearest existing
+// ancestor while the folder does not exist yet. The file's identity is taken on the loop; a
+// read of the database (which may wait for a writer's lock) runs on the loop's worker pool,
+// one at a time.
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
-#include <thread>
 
 #include "account/DataGet.h"
 
 namespace kesu {
 
+class EventLoop;
+class PeriodicTimer;
+
 class FileMonitor {
 public:
     using TimePoint = std::chrono::system_clock::time_point;
 
-    // `databaseFilePath` is the folder of Config.db. The poll period and the push client's
-    // port are taken from Config now.
-    explicit FileMonitor(std::string databaseFilePath);
-    ~FileMonitor();
+    // `databaseFilePath` is the folder of Config.db. The push client's port is taken from
+    // Config now; the period is read from Config before every wait.
+    FileMonitor(EventLoop& loop, std::string databaseFilePath);
+    ~FileMonitor();  // stop()
     FileMonitor(const FileMonitor&) = delete;
     FileMonitor& operator=(const FileMonitor&) = delete;
 
-    // Starts the polling thread; its first pass runs at once. False when already running.
+    // Starts the watch; its first pass runs at once. False when already running.
     bool start();
-    // Ends the loop at once and joins its thread; harmless when it does not run.
+    // No pass starts after this; waits (bounded) for a pass under way. Harmless when it does
+    // not run. Not from the loop itself.
     void stop();
     bool running() const;
 
-    // One pass of the loop. Runs on the polling thread; tests call it directly instead of
-    // starting the thread (never both).
+    // One pass, inspection and read. Tests call it directly instead of starting the watch
+    // (never both).
     void runPass();
 
     const std::string& databaseFilePath() const { return databaseFilePath_; }
@@ -65,17 +75,28 @@ public:
     static std::string dateDescription(TimePoint time);
 
 private:
-    void loop();
+    struct Watch;
+    struct Passes;
+
+    enum class Read { None, Changed, Retry };
+    // The first half of a pass: the file's identity and what it asks for.
+    Read inspect();
+    // The second half, which may wait for the database's lock.
+    void readFile(Read read);
+    // Loop: inspects the file and reads it on the pool unless a read is under way (then one
+    // more pass follows it).
+    void tick();
     void readAndAnnounce();
     // Records the state and logs it when it differs from the last one.
     void enterState(DatabaseState next, const std::string& detail);
     void announce();
 
+    EventLoop& loop_;
     const std::string databaseFilePath_;
-    const std::chrono::milliseconds period_;
     const int pushClientPort_;
 
-    // State of the passes; touched only by the thread that runs them.
+    // State of the passes; touched by one pass at a time (its inspection on the loop, its
+    // read on the pool).
     TimePoint lastModifyTime;
     bool firstRead = true;
     int databaseReadTimes = 0;
@@ -84,15 +105,16 @@ private:
 
     std::mutex lifecycle_;  // start() and stop() one at a time
     mutable std::mutex mutex_;
-    std::condition_variable wake_;
-    bool stopping_ = false;
-    std::thread thread_;
+    std::shared_ptr<Passes> passes_;        // shared with the pass under way
+    std::shared_ptr<PeriodicTimer> timer_;  // shared with a finished pass's hand-back
+    std::shared_ptr<Watch> watch_;          // the inotify watch, loop only
+    std::atomic<bool> running_{false};
 };
 
-// Starts the process-wide monitor on the PC suite's database folder, then fills the PC's
-// device id and version. False when a monitor already runs.
-bool fileMonitorStart();
-// Stops the process-wide monitor (orderly stop, tests).
+// Starts the process-wide monitor on the PC suite's database folder on `loop`, then fills the
+// PC's device id and version. False when a monitor already runs.
+bool fileMonitorStart(EventLoop& loop);
+// Stops and drops the process-wide monitor (orderly stop, tests); before the loop ends.
 void fileMonitorStop();
 
 }  // namespace kesu

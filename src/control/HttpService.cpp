@@ -1,11 +1,13 @@
 #include "control/HttpService.h"
 
 #include <httplib.h>
+#include <pthread.h>
 #include <sys/socket.h>
 
 #include <cstdio>
 #include <cstring>
 
+#include "control/OnDemandTaskQueue.h"
 #include "control/PeerCheckedServer.h"
 #include "control/RequestHandle.h"
 #include "control/ResponseHandler.h"
@@ -44,8 +46,11 @@ bool HttpService::startHttpServic() {
     // access tokens and switches the signed-in account.
     PeerGate* gate = &gate_;
     auto server = std::make_unique<PeerCheckedServer>([gate](socket_t sock) { return gate->admit(sock); });
+    // Workers on demand: an idle service keeps one, a burst gets up to controlThreads.
     const int threads = config.controlThreads;
-    server->new_task_queue = [threads] { return new httplib::ThreadPool(static_cast<size_t>(threads)); };
+    server->new_task_queue = [threads] {
+        return new OnDemandTaskQueue(static_cast<std::size_t>(threads), std::chrono::seconds(5));
+    };
     server->set_payload_max_length(config.controlMaxBody);
     server->set_read_timeout(config.controlReadTimeout);
     server->set_write_timeout(config.controlReadTimeout);
@@ -91,6 +96,7 @@ bool HttpService::startHttpServic() {
     auto ended = std::make_shared<std::promise<void>>();
     listenerEnded_ = ended->get_future();
     listener_ = std::thread([raw, ended] {
+        pthread_setname_np(pthread_self(), "kesu-listen");
         raw->listen_after_bind();
         ended->set_value();
     });

@@ -23,10 +23,9 @@ struct Config {
     int controlThreads = 16;                   // some handlers block for a whole connection
     std::chrono::seconds controlReadTimeout{5};
 
-    // PC suite's local HTTP server, telemetry collector and the local push client.
+    // PC suite's local HTTP server and the local push client.
     std::string pcsuiteHost = "127.0.0.1";
     int pcsuitePort = 9199;
-    int buryPointUdpPort = 9997;
     int pushClientUdpPort = 13601;
 
     // Phone-side TCP port (both directions) and LAN discovery.
@@ -88,7 +87,6 @@ struct Config {
     std::chrono::milliseconds httpWaitTimeout{60000};
     std::size_t httpMaxAnswerBody = 16 << 20;  // larger answers are dropped unread
     std::string caCertPath;                    // extra trusted CA file for https; empty: system store
-    std::string buryPointUdpHost = "127.0.0.1";
 
     // Fixed paths of the PC suite's bundle, before KESU_ROOT is applied.
     std::string versionFile =

@@ -198,12 +198,6 @@ double Utils::currentTimeStamp() {
     return std::chrono::duration<double>(now().time_since_epoch()).count();
 }
 
-long long Utils::stringToTimestamp(const std::string& time) {
-    auto parsed = timeutil::parseLocal(time);
-    if (!parsed) return 0;
-    return std::chrono::floor<std::chrono::seconds>(parsed->time_since_epoch()).count();
-}
-
 void Utils::deleteOldLogFile() {
     const std::string dir = logDirectory();
     std::error_code ec;

@@ -37,11 +37,11 @@ int runService() {
     Utils::deleteOldLogFile();
     Utils::GetPcSystemInfo();
     HttpService::httpService().startHttpServic();
-    fileMonitorStart();
-    updateHistoryDevice();
-
     EventLoop loop;
     loop.start();
+    fileMonitorStart(loop);
+    updateHistoryDevice();
+
     ServiceManager manager(loop);
     manager.start();
     HttpAliveCheck watchdog(loop);

@@ -34,7 +34,6 @@ public:
     static void writeConnServiceVersion(const std::string& version);
     static std::string getNowTime();          // local "yyyy-MM-dd HH:mm:ss.SSS"
     static double currentTimeStamp();         // seconds since 1970, with fraction
-    static long long stringToTimestamp(const std::string& time);  // 0 when it does not parse
     static Clock::time_point now();
     // Replaces the clock (tests); an empty function puts the system clock back.
     static void setClock(std::function<Clock::time_point()> clock);
@@ -44,7 +43,6 @@ public:
     static std::string libraryBase();                  // home + "/Library/"
 
     // ---- Processes and files -----------------------------------------------------------
-    static bool useCommandLine(const std::string& command);
     static bool startProcess(const std::string& launchPath, const std::vector<std::string>& arguments,
                              int& exitCode);
     static bool isAppRunning(const std::string& appName);
@@ -60,7 +58,6 @@ public:
     static std::string getFullLocalName();
     static std::string paramAddMask(const std::string& str);
     static std::string getMacAddress();
-    static std::string getMacAddress2();
     static std::string getBluetoothMacAddress();
     static std::map<std::string, std::string> GetPcSystemInfo();
 

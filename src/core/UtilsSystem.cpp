@@ -113,15 +113,6 @@ void appendUtf8(std::string& out, unsigned codePoint) {
 
 // ---- Processes and files -------------------------------------------------------------------
 
-bool Utils::useCommandLine(const std::string& command) {
-    std::string error;
-    if (!process::runAndWait("/bin/bash", {"-c", command}, error)) {
-        mPrintlog("[useCommandLine] something went wrong, error: " + error);
-        return false;
-    }
-    return true;
-}
-
 bool Utils::startProcess(const std::string& launchPath, const std::vector<std::string>& arguments, int& exitCode) {
     std::string error;
     if (!process::spawnDetached(launchPath, arguments, error)) {
@@ -189,8 +180,6 @@ std::string Utils::paramAddMask(const std::string& str) {
 }
 
 std::string Utils::getMacAddress() { return withoutColons(primaryHardwareAddress()); }
-
-std::string Utils::getMacAddress2() { return primaryHardwareAddress(); }
 
 std::string Utils::getBluetoothMacAddress() { return Platform::current().bluetoothAddress(); }
 

@@ -244,13 +244,4 @@ std::string RequestBase::maskForLog(const std::string& text) {
     return text;
 }
 
-std::string RequestBase::headersForLog(const Headers& headers) {
-    std::string out;
-    for (const auto& [name, value] : headers) {
-        if (!out.empty()) out += ", ";
-        out += name + ": " + (isCredentialName(name) ? Utils::paramAddMask(value) : value);
-    }
-    return out;
-}
-
 }  // namespace kesu

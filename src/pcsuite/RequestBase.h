@@ -56,8 +56,6 @@ public:
     // A text fit for the log: in a JSON text (optionally "N#"-framed) every string member
     // whose name mentions a token, a password or a secret is masked; other texts unchanged.
     static std::string maskForLog(const std::string& text);
-    // Header pairs as "name: value" joined by ", ", credential values masked.
-    static std::string headersForLog(const Headers& headers);
 };
 
 }  // namespace kesu

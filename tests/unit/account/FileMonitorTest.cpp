@@ -12,6 +12,7 @@
 #include <functional>
 
 #include "account/DataGet.h"
+#include "core/EventLoop.h"
 #include "support/UdpCatcher.h"
 #include "unit/account/AccountFixture.h"
 #include "unit/events/EventRecorder.h"
@@ -25,11 +26,13 @@ class FileMonitorTest : public AccountFixture {
 protected:
     void SetUp() override {
         AccountFixture::SetUp();
+        loop.start();
         env.config().pushClientUdpPort = pushClient.port();
         EventPublisher::instance().clearObservers();
         EventPublisher::instance().addObserver(events);
     }
     void TearDown() override {
+        loop.stop();
         EventPublisher::instance().clearObservers();
         AccountFixture::TearDown();
     }
@@ -54,6 +57,7 @@ protected:
     // A datagram already queued (loopback delivers during the send), if any.
     std::optional<std::string> sent() { return pushClient.receive(0ms); }
 
+    EventLoop loop;
     UdpCatcher pushClient;
     std::shared_ptr<EventRecorder> events = std::make_shared<EventRecorder>();
 };
@@ -61,7 +65,7 @@ protected:
 TEST_F(FileMonitorTest, PassesFollowTheDatabaseFile) {
     writeDatabase(dbFile(), kSignedInRows);
     setModified(dbFile(), 1'700'000'000);
-    FileMonitor monitor(dbDir());
+    FileMonitor monitor(loop, dbDir());
 
     // First pass: read, client-id query, event.
     monitor.runPass();
@@ -172,7 +176,7 @@ TEST_F(FileMonitorTest, BadFilesKeepTheServiceGoingAndAreLoggedOncePerChange) {
         setModified(dbFile(), ++stamp);
     };
     good();
-    FileMonitor monitor(dbDir());
+    FileMonitor monitor(loop, dbDir());
     monitor.runPass();
     ASSERT_EQ(monitor.state(), DatabaseState::Good);
     EXPECT_EQ(stateLines(), 1);  // the first look counts as a change
@@ -210,7 +214,7 @@ TEST_F(FileMonitorTest, LockedDatabaseKeepsTheAccountUntilTheLockGoes) {
     env.config().databaseBusyTimeout = 20ms;
     writeDatabase(dbFile(), kSignedInRows);
     setModified(dbFile(), 1'700'000'000);
-    FileMonitor monitor(dbDir());
+    FileMonitor monitor(loop, dbDir());
     monitor.runPass();
     ASSERT_EQ(dataInstance().get().openid, "oid-1");
     ASSERT_TRUE(sent());
@@ -260,7 +264,7 @@ TEST_F(FileMonitorTest, LockedDatabaseKeepsTheAccountUntilTheLockGoes) {
 TEST_F(FileMonitorTest, FileReplacedByRenameIsRead) {
     writeDatabase(dbFile(), kSignedInRows);
     setModified(dbFile(), 1'700'000'000);
-    FileMonitor monitor(dbDir());
+    FileMonitor monitor(loop, dbDir());
     monitor.runPass();
     ASSERT_EQ(dataInstance().get().openid, "oid-1");
 
@@ -304,19 +308,31 @@ TEST_F(FileMonitorTest, AttributesOfAVanishedFileAreNoChange) {
     EXPECT_EQ(FileMonitor::getLocalDate("1970-01-01 00:00:00 +0000 trailing"), "");
 }
 
-TEST_F(FileMonitorTest, ThreadReadsAtOnceSeesTouchesAndStops) {
-    env.config().fileMonitorPeriod = std::chrono::milliseconds(10);
-    writeDatabase(dbFile(), kSignedInRows);
-    setModified(dbFile(), 1'700'000'000);
-    FileMonitor monitor(dbDir());
+// With a period far beyond the test's limits only the change notification can bring the
+// account in: the folder appearing after the start, then a new file renamed over the old one.
+TEST_F(FileMonitorTest, ChangesAreSeenWithoutWaitingForThePeriod) {
+    env.config().fileMonitorPeriod = std::chrono::hours(1);
+    std::filesystem::remove_all(supportDir());
+    FileMonitor monitor(loop, dbDir());
     ASSERT_TRUE(monitor.start());
     EXPECT_FALSE(monitor.start());
-    ASSERT_TRUE(events->waitFor("AccountChangeEvent", 1));
-    setModified(dbFile(), 1'700'000'500);
-    ASSERT_TRUE(events->waitFor("AccountChangeEvent", 2));
+    ASSERT_TRUE(loop.call([] {}));  // the watch is armed
+    auto replace = [&](const std::string& rows) {
+        const std::string next = dbDir() + "/Config.db.new";
+        writeDatabase(next, rows);
+        std::filesystem::rename(next, dbFile());
+    };
+
+    std::filesystem::create_directories(dbDir());
+    replace(kSignedInRows);
+    ASSERT_TRUE(events->waitFor("AccountChangeEvent", 1, 10s));
+    EXPECT_EQ(dataInstance().get().openid, "oid-1");
+
+    replace("INSERT INTO User VALUES ('oid-2', '13812345678', 'tok-SECRET-2');");
+    ASSERT_TRUE(events->waitFor("AccountChangeEvent", 2, 10s));
+    EXPECT_EQ(dataInstance().get().openid, "oid-2");
     monitor.stop();
     EXPECT_FALSE(monitor.running());
-    EXPECT_EQ(dataInstance().get().openid, "oid-1");
 }
 
 TEST_F(FileMonitorTest, ServiceStartReadsWithoutWaitingAPeriodAndFillsTheDeviceId) {
@@ -327,10 +343,10 @@ TEST_F(FileMonitorTest, ServiceStartReadsWithoutWaitingAPeriodAndFillsTheDeviceI
     env.dir().write("home/Library/Application Support/pcsuite/config.json", R"({"newDeviceId": "file-id"})");
     writeDatabase(dbFile(), kSignedInRows);
 
-    ASSERT_TRUE(fileMonitorStart());
+    ASSERT_TRUE(fileMonitorStart(loop));
     EXPECT_EQ(dataInstance().get().pcDeviceId, "file-id");
     EXPECT_EQ(dataInstance().get().version, Utils::versionCode);
-    EXPECT_FALSE(fileMonitorStart());
+    EXPECT_FALSE(fileMonitorStart(loop));
     ASSERT_TRUE(events->waitFor("AccountChangeEvent", 1));
     EXPECT_EQ(dataInstance().get().openid, "oid-1");
     fileMonitorStop();

@@ -86,7 +86,6 @@ TEST_F(UtilsSystem, MacAddressAndNetworkSnapshot) {
     EXPECT_EQ(Utils::getMacAddress(), "aa0000000002");
     fake->addAdapter("Wi-Fi", "wlan0", "bb:00:00:00:00:01");
     EXPECT_EQ(Utils::getMacAddress(), "bb0000000001");
-    EXPECT_EQ(Utils::getMacAddress2(), "bb:00:00:00:00:01");
 
     fake->setWifiSsid("Caf\xC3\xA9");
     EXPECT_EQ(Utils::getNetworkCorrespondAddress(),
@@ -155,10 +154,7 @@ TEST_F(UtilsSystem, PingTakesOnlyIpv4LiteralsAndCommandsRunToTheirEnd) {
     fake->setPingResult(false);
     EXPECT_FALSE(Utils::pingAddress("127.0.0.1", 0));
 
-    // The command's exit status does not matter; a program that cannot start is -1.
-    const std::string out = env.dir().str() + "/out.txt";
-    EXPECT_TRUE(Utils::useCommandLine("printf 'done' > '" + out + "'; exit 3"));
-    EXPECT_EQ(test::readAll(out), "done");
+    // A program that cannot start is -1.
     int exitCode = 5;
     EXPECT_FALSE(Utils::startProcess(env.dir().str() + "/no-such-program", {}, exitCode));
     EXPECT_EQ(exitCode, -1);
