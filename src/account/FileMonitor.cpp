@@ -183,8 +183,15 @@ bool FileMonitor::start() {
             if (auto t = timer.lock()) t->runNow();
         });
         watch_->open();
+        // The first pass is done before start() returns, so that what starts next (the
+        // announcements, the reports) already carries the signed-in account.
+        try {
+            runPass();
+        } catch (const std::exception& e) {
+            Utils::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
+        }
     });
-    timer_->start(std::chrono::milliseconds(0));
+    timer_->start();
     return true;
 }
 

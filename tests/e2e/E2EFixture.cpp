@@ -58,7 +58,8 @@ std::unique_ptr<ServiceProcess> LabTest::startService() {
     auto p = std::make_unique<ServiceProcess>(KESU_BINARY, std::vector<std::string>{},
                                               std::map<std::string, std::string>{{"HOME", home}, {"KESU_ROOT", root}},
                                               pc.ns, ServiceProcess::Pids::own);
-    EXPECT_TRUE(p->waitForOutput("[httpService]Run succ", 20s)) << p->output();
+    // Started once the phone server listens: discovery and the account are up by then.
+    EXPECT_TRUE(p->waitForOutput("[ConnectStatusGet] Server Socket is open", 20s)) << p->output();
     return p;
 }
 

@@ -37,7 +37,7 @@ protected:
     // Adds a phone node 10.77.0.<host> to the lab.
     NetNsLab::Node addPhone(const std::string& name, int host);
     // Starts the real service in the PC node, in a PID namespace of its own (so a service
-    // running on the machine does not stop it), and waits until its control API runs.
+    // running on the machine does not stop it), and waits until it has started (its phone server listens).
     std::unique_ptr<ServiceProcess> startService();
     // A stand-in for the PC suite's HTTP server on every address of the PC node, port 9199.
     std::unique_ptr<StubPcSuite> startPcSuite();
