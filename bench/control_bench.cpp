@@ -36,16 +36,23 @@ namespace {
 
 using namespace kesu::bench;
 
-// A raw TCP echo on loopback: the floor for any request/answer exchange on this machine.
-std::vector<double> echoRoundTrips(int count, size_t payload) {
+// A listening socket on an ephemeral loopback port; its address in `addr`.
+int loopbackListener(sockaddr_in& addr, int backlog) {
     int listener = ::socket(AF_INET, SOCK_STREAM, 0);
-    sockaddr_in addr{};
+    addr = sockaddr_in{};
     addr.sin_family = AF_INET;
     addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
     ::bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
     socklen_t len = sizeof addr;
     ::getsockname(listener, reinterpret_cast<sockaddr*>(&addr), &len);
-    ::listen(listener, 1);
+    ::listen(listener, backlog);
+    return listener;
+}
+
+// A raw TCP echo on loopback: the floor for any request/answer exchange on this machine.
+std::vector<double> echoRoundTrips(int count, size_t payload) {
+    sockaddr_in addr{};
+    const int listener = loopbackListener(addr, 1);
     std::thread server([listener] {
         int c = ::accept(listener, nullptr, nullptr);
         int one = 1;
@@ -82,14 +89,8 @@ std::vector<double> echoRoundTrips(int count, size_t payload) {
 // A raw TCP echo on loopback with a new connection per round trip: connect, send, read the
 // echo, close. The floor for a request on a fresh connection.
 std::vector<double> connectEchoRoundTrips(int count, size_t payload) {
-    int listener = ::socket(AF_INET, SOCK_STREAM, 0);
     sockaddr_in addr{};
-    addr.sin_family = AF_INET;
-    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    ::bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
-    socklen_t len = sizeof addr;
-    ::getsockname(listener, reinterpret_cast<sockaddr*>(&addr), &len);
-    ::listen(listener, 64);
+    const int listener = loopbackListener(addr, 64);
     std::thread server([listener, count] {
         char buf[4096];
         for (int i = 0; i < count; ++i) {
@@ -130,14 +131,8 @@ std::vector<double> connectEchoRoundTrips(int count, size_t payload) {
 // against `count` getpeername calls on the same socket (the floor of any per-connection
 // work); both totals in microseconds.
 std::pair<double, double> lookupCost(int count) {
-    int listener = ::socket(AF_INET, SOCK_STREAM, 0);
     sockaddr_in addr{};
-    addr.sin_family = AF_INET;
-    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    ::bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
-    socklen_t len = sizeof addr;
-    ::getsockname(listener, reinterpret_cast<sockaddr*>(&addr), &len);
-    ::listen(listener, 1);
+    const int listener = loopbackListener(addr, 1);
     int client = ::socket(AF_INET, SOCK_STREAM, 0);
     ::connect(client, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
     int served = ::accept(listener, nullptr, nullptr);
