@@ -49,6 +49,17 @@ int loopbackListener(sockaddr_in& addr, int backlog) {
     return listener;
 }
 
+// Writes `msg` on `s` and reads as many bytes back into `buf`.
+void sendAndReadEcho(int s, const std::string& msg, std::vector<char>& buf) {
+    ::write(s, msg.data(), msg.size());
+    size_t got = 0;
+    while (got < msg.size()) {
+        ssize_t n = ::read(s, buf.data() + got, msg.size() - got);
+        if (n <= 0) break;
+        got += static_cast<size_t>(n);
+    }
+}
+
 // A raw TCP echo on loopback: the floor for any request/answer exchange on this machine.
 std::vector<double> echoRoundTrips(int count, size_t payload) {
     sockaddr_in addr{};
@@ -71,13 +82,7 @@ std::vector<double> echoRoundTrips(int count, size_t payload) {
     std::vector<double> out;
     for (int i = 0; i < count; ++i) {
         auto t0 = Clock::now();
-        ::write(s, msg.data(), msg.size());
-        size_t got = 0;
-        while (got < payload) {
-            ssize_t n = ::read(s, buf.data() + got, payload - got);
-            if (n <= 0) break;
-            got += static_cast<size_t>(n);
-        }
+        sendAndReadEcho(s, msg, buf);
         out.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
     }
     ::close(s);
@@ -112,13 +117,7 @@ std::vector<double> connectEchoRoundTrips(int count, size_t payload) {
         int one = 1;
         setsockopt(s, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
         ::connect(s, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
-        ::write(s, msg.data(), msg.size());
-        size_t got = 0;
-        while (got < payload) {
-            ssize_t n = ::read(s, buf.data() + got, payload - got);
-            if (n <= 0) break;
-            got += static_cast<size_t>(n);
-        }
+        sendAndReadEcho(s, msg, buf);
         ::close(s);
         out.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
     }
