@@ -16,7 +16,7 @@
 
 #include "BenchSupport.h"
 #include "core/Json.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 #include "discovery/Base64.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/SsdpMessage.h"
@@ -97,7 +97,7 @@ int main(int argc, char** argv) {
     if (benchmark::ReportUnrecognizedArguments(argc, argv)) return 1;
     benchmark::RunSpecifiedBenchmarks();
     benchmark::Shutdown();
-    kesu::Utils::closeLog();
+    kesu::Log::closeLog();
     std::filesystem::remove_all(scratch);
     return 0;
 }

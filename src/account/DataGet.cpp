@@ -12,7 +12,10 @@
 #include "core/Config.h"
 #include "core/Json.h"
 #include "core/Text.h"
-#include "core/Utils.h"
+#include "core/Files.h"
+#include "core/Log.h"
+#include "core/Text.h"
+#include "core/WallClock.h"
 #include "pcsuite/PcsuiteRequest.h"
 
 namespace kesu {
@@ -117,7 +120,7 @@ void FilePathget(std::string& fileStringPath) {
     std::string base;
     const bool sandboxed = getSanboxPth(base);
     fileStringPath = base + "Application Support/pcsuite/DataBase";
-    Utils::mPrintlog(std::string("[Sandbox]Service is in sandbox? ") + (sandboxed ? "true" : "false"));
+    Log::mPrintlog(std::string("[Sandbox]Service is in sandbox? ") + (sandboxed ? "true" : "false"));
 }
 
 std::string pcsuiteConfigFilePath() { return pcsuiteSupportDir() + "config.json"; }
@@ -137,7 +140,7 @@ void AccountRows::add(const ColumnValue& first, const ColumnValue& second, const
     first_ = accountText(first).value_or("");
     third_ = accountText(third).value_or("");
     if (!userTable_) second_ = accountText(second).value_or("");
-    else if (auto phone = accountText(second)) phone_ = Utils::paramAddMask(*phone);
+    else if (auto phone = accountText(second)) phone_ = text::paramAddMask(*phone);
 }
 
 void AccountRows::applyTo(databaseParam& p) const {
@@ -238,14 +241,14 @@ DatabaseReadResult readAccountDatabase(const std::string& filePath) {
 
 void logDatabaseRead(const DatabaseReadResult& result) {
     if (result.openFailed) {
-        Utils::mPrintlog("[dataBaseRead] Database file Config.db open failed due to : " + result.detail +
-                         " current time is: " + Utils::getNowTime());
+        Log::mPrintlog("[dataBaseRead] Database file Config.db open failed due to : " + result.detail +
+                         " current time is: " + WallClock::getNowTime());
         return;
     }
-    Utils::mPrintlog("[dataBaseRead]  DataBase file Config.db open success");
+    Log::mPrintlog("[dataBaseRead]  DataBase file Config.db open success");
     if (!result.failedTable.empty()) {
-        Utils::mPrintlog("[readDatabase] read database Table " + result.failedTable + " failed");
-        Utils::mPrintlog("[readDatabase] SQLite says: " + result.detail);
+        Log::mPrintlog("[readDatabase] read database Table " + result.failedTable + " failed");
+        Log::mPrintlog("[readDatabase] SQLite says: " + result.detail);
     }
     if (result.state == DatabaseState::Good) notifySSDP(result.softwareSetRead);
 }
@@ -259,7 +262,7 @@ DatabaseReadResult dataBaseRead(const std::string& filePath) {
 bool notifySSDP(bool retDBRead) {
     if (retDBRead) {
         const databaseParam p = dataInstance().get();
-        Utils::mPrintlog("[notifySSDP] notifySSDP- Currently data param is openid: " + p.openid + " \r phone: " +
+        Log::mPrintlog("[notifySSDP] notifySSDP- Currently data param is openid: " + p.openid + " \r phone: " +
                          p.Phone + " \r ConfigDir: " + p.configDir + " \r StorageDir: " + p.storageDir);
     }
     return retDBRead;
@@ -274,33 +277,33 @@ std::string getPcsuiteDeviceInfo() {
             p.pcDeviceId = deviceId;
             p.version = version;
         });
-        Utils::mPrintlog("[getPcsuiteDeviceId] Request pcsuite id: " + deviceId + ", version: " + version);
+        Log::mPrintlog("[getPcsuiteDeviceId] Request pcsuite id: " + deviceId + ", version: " + version);
     }
     dataInstance().update([](databaseParam& p) {
-        if (p.version.empty()) p.version = Utils::versionCode;
+        if (p.version.empty()) p.version = Log::versionCode;
     });
     if (dataInstance().get(&databaseParam::pcDeviceId).empty()) {
         const std::string path = pcsuiteConfigFilePath();
-        Utils::mPrintlog("[getPcsuiteDeviceInfo] Read file path is: " + path);
+        Log::mPrintlog("[getPcsuiteDeviceInfo] Read file path is: " + path);
         std::string content;
-        Utils::readFile(path, content);
+        Files::readFile(path, content);
         if (!content.empty()) dataInstance().set(&databaseParam::pcDeviceId, deviceIdFromConfigText(content));
         if (dataInstance().get(&databaseParam::pcDeviceId).empty())
-            Utils::mPrintlog("[getPcsuiteDeviceId] Device ID retrieval failed.");
+            Log::mPrintlog("[getPcsuiteDeviceId] Device ID retrieval failed.");
     }
     return dataInstance().get(&databaseParam::pcDeviceId);
 }
 
 void updateHistoryDevice() {
     const std::string path = historyPhoneFilePath();
-    Utils::mPrintlog("[updateHistoryDevice] Read file path is: " + path);
+    Log::mPrintlog("[updateHistoryDevice] Read file path is: " + path);
     std::string content;
-    Utils::readFile(path, content);
+    Files::readFile(path, content);
     if (content.empty()) return;
     const auto ids = historyIdsFromText(content);
     if (!ids) {
         // A half-written file says nothing about the last devices: keep what we know.
-        Utils::mPrintlog("[updateHistoryDevice] history file is not valid JSON, ids kept");
+        Log::mPrintlog("[updateHistoryDevice] history file is not valid JSON, ids kept");
         return;
     }
     const std::string& phoneId = ids->first;
@@ -309,7 +312,7 @@ void updateHistoryDevice() {
         p.historyPhoneId = phoneId;
         p.historyPadId = padId;
     });
-    Utils::mPrintlog("[updateHistoryDevice] historyPhoneId: " + phoneId + ", historyPadId: " + padId + " ");
+    Log::mPrintlog("[updateHistoryDevice] historyPhoneId: " + phoneId + ", historyPadId: " + padId + " ");
 }
 
 bool retGet() { return databaseUpdate.load(); }

@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "account/DataInstance.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -84,7 +85,7 @@ void logDatabaseRead(const DatabaseReadResult& result);
 
 // The library base below which the PC suite keeps its data, stored in `HomePathsand`.
 // Returns true when the service runs sandboxed (never on Linux: the base is then always
-// home + "/Library/", the same as Utils::libraryBase()).
+// home + "/Library/", the same as Log::libraryBase()).
 bool getSanboxPth(std::string& HomePathsand);
 
 // The library base of a sandbox container home ("/Users/name/Library/Containers/app/Data"

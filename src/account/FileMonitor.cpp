@@ -28,7 +28,8 @@
 #include "core/EventLoop.h"
 #include "core/Json.h"
 #include "core/PeriodicTimer.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "core/WallClock.h"
 #include "events/EventPublisher.h"
 
 namespace kesu {
@@ -60,7 +61,7 @@ struct FileMonitor::Watch : std::enable_shared_from_this<Watch> {
     void open() {
         const int fd = ::inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
         if (fd < 0) {
-            Utils::mPrintlog(std::string("[fileMonitorStart] no change notification (") + std::strerror(errno) +
+            Log::mPrintlog(std::string("[fileMonitorStart] no change notification (") + std::strerror(errno) +
                              "), the database is checked every period only");
             return;
         }
@@ -161,7 +162,7 @@ FileMonitor::FileMonitor(EventLoop& loop, std::string databaseFilePath)
     : loop_(loop),
       databaseFilePath_(std::move(databaseFilePath)),
       pushClientPort_(Config::current().pushClientUdpPort),
-      lastModifyTime(Utils::now()),
+      lastModifyTime(WallClock::now()),
       passes_(std::make_shared<Passes>()),
       timer_(std::make_shared<PeriodicTimer>(loop.context(), [] { return Config::current().fileMonitorPeriod; },
                                              [this] { tick(); })) {}
@@ -188,7 +189,7 @@ bool FileMonitor::start() {
         try {
             runPass();
         } catch (const std::exception& e) {
-            Utils::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
+            Log::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
         }
     });
     timer_->start();
@@ -232,7 +233,7 @@ void FileMonitor::tick() {
     try {
         read = inspect();
     } catch (const std::exception& e) {
-        Utils::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
+        Log::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
     }
     if (read == Read::None) return;
     {
@@ -246,7 +247,7 @@ void FileMonitor::tick() {
                 readFile(read);
             } catch (const std::exception& e) {
                 // One bad pass must not end the watch.
-                Utils::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
+                Log::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
             }
             std::lock_guard<std::mutex> lock(passes->mutex);
             passes->underWay = false;
@@ -317,7 +318,7 @@ void FileMonitor::readFile(Read read) {
 }
 
 void FileMonitor::readAndAnnounce() {
-    Utils::mPrintlog("[fileMonitorStart] DataBase file changed recently at time stamp: " +
+    Log::mPrintlog("[fileMonitorStart] DataBase file changed recently at time stamp: " +
                      getLocalDate(dateDescription(lastModifyTime)));
     const DatabaseReadResult result = dataBaseRead(databaseFilePath_);
     enterState(result.state, result.detail);
@@ -345,18 +346,18 @@ void FileMonitor::enterState(DatabaseState next, const std::string& detail) {
     const std::string file = "[fileMonitorStart] Database file :" + databaseFilePath_ + "/" + kDatabaseFile;
     switch (next) {
         case DatabaseState::Missing:
-            Utils::mPrintlog("[fileExist] File lost. File :" + databaseFilePath_ + "/" + kDatabaseFile +
+            Log::mPrintlog("[fileExist] File lost. File :" + databaseFilePath_ + "/" + kDatabaseFile +
                              " is not exist");
-            Utils::mPrintlog(file + " is lost ，please fix it");
+            Log::mPrintlog(file + " is lost ，please fix it");
             break;
         case DatabaseState::Unreadable:
-            Utils::mPrintlog(file + " cannot be read (" + detail + "), the account is kept");
+            Log::mPrintlog(file + " cannot be read (" + detail + "), the account is kept");
             break;
         case DatabaseState::Busy:
-            Utils::mPrintlog(file + " is locked by another writer, the account is kept until it can be read");
+            Log::mPrintlog(file + " is locked by another writer, the account is kept until it can be read");
             break;
         case DatabaseState::Good:
-            Utils::mPrintlog(file + " is readable");
+            Log::mPrintlog(file + " is readable");
             break;
     }
 }
@@ -388,13 +389,13 @@ bool FileMonitor::fileAttributeGet(const std::string& directory, TimePoint& last
     const std::string path = directory + "/" + kDatabaseFile;
     const auto modified = modificationTime(path);
     if (!modified) {
-        Utils::mPrintlog("[fileAttributeGet] Cannot read the attributes of " + path + ": " + std::strerror(errno));
+        Log::mPrintlog("[fileAttributeGet] Cannot read the attributes of " + path + ": " + std::strerror(errno));
         return false;
     }
     const std::string when = getLocalDate(dateDescription(*modified));
     if (*modified != lastFileChange) {
         if (isFirstRead && readFileTimes == 0) {
-            Utils::mPrintlog("[fileAttributeGet] Time is : " + when + " is the database file Config.db read first time");
+            Log::mPrintlog("[fileAttributeGet] Time is : " + when + " is the database file Config.db read first time");
             isFirstRead = false;
         }
         ++readFileTimes;
@@ -402,7 +403,7 @@ bool FileMonitor::fileAttributeGet(const std::string& directory, TimePoint& last
         return true;
     }
     if (isFirstRead && readFileTimes == 0) {
-        Utils::mPrintlog("[fileAttributeGet] Time is : " + when + "is the database file Config.db read first time");
+        Log::mPrintlog("[fileAttributeGet] Time is : " + when + "is the database file Config.db read first time");
         isFirstRead = false;
         ++readFileTimes;
         return true;
@@ -453,7 +454,7 @@ bool fileMonitorStart(EventLoop& loop) {
         ProcessMonitor& holder = processMonitor();
         std::lock_guard<std::mutex> lock(holder.mutex);
         if (holder.monitor && holder.monitor->running()) {
-            Utils::mPrintlog("[fileMonitorStart] the database monitor runs already");
+            Log::mPrintlog("[fileMonitorStart] the database monitor runs already");
             return false;
         }
         // A stopped monitor has joined its thread and can go.

@@ -8,7 +8,7 @@ namespace kesu {
 namespace {
 
 constexpr std::array kErrorCodes = {
-    ErrorCode::UNKNOW,         ErrorCode::STATE_BUSY,       ErrorCode::NOT_FOUND,
+    ErrorCode::UNKNOWN,         ErrorCode::STATE_BUSY,       ErrorCode::NOT_FOUND,
     ErrorCode::BLE_COMM,       ErrorCode::REJECT,           ErrorCode::CANCEL,
     ErrorCode::CREATE_GO_FAILED, ErrorCode::TIMEOUT,        ErrorCode::IS_CANCELING,
     ErrorCode::API_NOT_FOUND,  ErrorCode::CREATE_AP_FAIL,   ErrorCode::PC_CANCELING,

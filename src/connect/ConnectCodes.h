@@ -10,7 +10,7 @@ namespace kesu {
 
 // The "error" of a connection reply to the PC suite; 0 (no case) means success.
 enum class ErrorCode : int {
-    UNKNOW = -10000,
+    UNKNOWN = -10000,
     STATE_BUSY = -10001,
     NOT_FOUND = -10002,
     BLE_COMM = -10003,

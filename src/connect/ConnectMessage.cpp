@@ -3,7 +3,8 @@
 #include "account/DataInstance.h"
 #include "connect/PhoneFrame.h"
 #include "core/Text.h"
-#include "core/Utils.h"
+#include "core/Text.h"
+#include "platform/SystemInfo.h"
 #include "discovery/SsdpMessage.h"
 
 namespace kesu {
@@ -13,11 +14,11 @@ namespace {
 // The members the request and the answers share.
 Json pcIdentity() {
     const databaseParam account = dataInstance().get();
-    return Json{{"deviceName", Utils::getLocalName()},
+    return Json{{"deviceName", SystemInfo::getLocalName()},
                 {"channel", 0},
                 {"id", kConnectMessageId},
                 {"open_Id", account.openid},
-                {"target_id", Utils::getMacAddress()},
+                {"target_id", SystemInfo::getMacAddress()},
                 {"account", account.Phone}};
 }
 
@@ -60,7 +61,7 @@ std::optional<PhoneConnectRequest> PhoneConnectRequest::parse(std::string_view b
 
     PhoneConnectRequest request;
     request.deviceId = SsdpMessage::deviceIdentifier(json::str(*message, "target_id"));
-    request.account = Utils::paramAddMask(json::str(*message, "account"));
+    request.account = text::paramAddMask(json::str(*message, "account"));
     request.serviceId = json::str(*message, "service_id");
     request.deviceName = json::str(*message, "deviceName");
     request.openId = json::str(*message, "open_Id");

@@ -34,7 +34,7 @@ public:
         return true;
     }
     virtual bool isSocketNull() { return false; }
-    virtual std::string getSokcetType() { return ""; }
+    virtual std::string getSocketType() { return ""; }
 };
 
 }  // namespace kesu

@@ -5,7 +5,10 @@
 #include "core/Config.h"
 #include "core/EventLoop.h"
 #include "core/Json.h"
-#include "core/Utils.h"
+#include "connect/ConnectionState.h"
+#include "core/Log.h"
+#include "core/Process.h"
+#include "pcsuite/PcsuiteClient.h"
 #include "pcsuite/BuryPoint.h"
 #include "pcsuite/RequestBase.h"
 
@@ -50,13 +53,13 @@ std::vector<std::string> LaunchService::pcSuiteArguments(const std::string& ip, 
 
 asio::awaitable<void> LaunchService::launchService(std::string ip, std::string localIp, AppSource appSource,
                                                    PhoneConnectRequest request, SendTcp sendTcp) {
-    Utils::mPrintlog("[launchService] mac receive LAN connection \n");
+    Log::mPrintlog("[launchService] mac receive LAN connection \n");
     const bool forPcsuite = appSource == AppSource::pcsuite;
     if (forPcsuite) {
         // The answer of this request's allow window starts unknown. (A sharing request has no
         // window and leaves a running PC suite request's answer alone.)
-        Utils::setIsAllowWindow(false);
-        Utils::setThisPhoneAutoConnect(false);
+        ConnectionState::setIsAllowWindow(false);
+        ConnectionState::setThisPhoneAutoConnect(false);
 
         struct Busy {
             bool connectable = false;
@@ -66,18 +69,18 @@ asio::awaitable<void> LaunchService::launchService(std::string ip, std::string l
         auto askPcSuite = [&request] {
             Busy answer;
             answer.connectable =
-                Utils::isDeviceConnectable(request.deviceType, answer.respondDeviceType, answer.connectStatus);
+                PcsuiteClient::isDeviceConnectable(request.deviceType, answer.respondDeviceType, answer.connectStatus);
             return answer;
         };
         const Busy busy = co_await loop_.runBlocking(std::move(askPcSuite));
         if (!busy.connectable) {
             if (busy.respondDeviceType == request.deviceType) {
-                Utils::mPrintlog("[launchService] PC has connected other device, same deviceType busy!\n");
+                Log::mPrintlog("[launchService] PC has connected other device, same deviceType busy!\n");
                 co_await sendTcp(ConnectTag::BUSY, serviceId::pcsuiteId);
             } else {
-                Utils::mPrintlog("[launchService] PC has connected other device, different deviceType busy!\n");
+                Log::mPrintlog("[launchService] PC has connected other device, different deviceType busy!\n");
                 co_await sendTcp(ConnectTag::DIFFDEVICEBUSY, serviceId::pcsuiteId);
-                Utils::mPrintlog("[launchService] Final finished\n");
+                Log::mPrintlog("[launchService] Final finished\n");
             }
             co_return;
         }
@@ -85,9 +88,9 @@ asio::awaitable<void> LaunchService::launchService(std::string ip, std::string l
 
     const BuryPoint::Record record = BuryPoint::listRecord("W688|10159", Json::object(), Json{{"finish", 1}});
     const std::string buryPointStr = BuryPoint::listText(record, true);
-    Utils::mPrintlog("[launchService] sendBuryPoint buryPointStr is: " + buryPointStr);
+    Log::mPrintlog("[launchService] sendBuryPoint buryPointStr is: " + buryPointStr);
     auto sendBuryPoint = [&buryPointStr] {
-        if (Utils::sendBuryPoint(buryPointStr)) Utils::mPrintlog("[launchService] sendBuryPoint success \n");
+        if (PcsuiteClient::sendBuryPoint(buryPointStr)) Log::mPrintlog("[launchService] sendBuryPoint success \n");
     };
     co_await loop_.runBlocking(std::move(sendBuryPoint));
 
@@ -97,30 +100,30 @@ asio::awaitable<void> LaunchService::launchService(std::string ip, std::string l
                                   request.deviceType);
     };
     const int exitCode = !forPcsuite ? 0 : co_await loop_.runBlocking(std::move(showWindow));
-    Utils::mPrintlog("[launchService] startAllowedWindow exitCode is " + std::to_string(exitCode));
-    if (exitCode != 0) Utils::mPrintlog("[launchService] reject for exitCode " + std::to_string(exitCode));
+    Log::mPrintlog("[launchService] startAllowedWindow exitCode is " + std::to_string(exitCode));
+    if (exitCode != 0) Log::mPrintlog("[launchService] reject for exitCode " + std::to_string(exitCode));
 
     // A sequence number is used up only by a hand-over that happens, so the receiver sees
     // 0, 1, 2, ... with no gap for a refused request.
     if (forPcsuite) {
-        Utils::mPrintlog("[launchService] launch service is pcsuite \n");
-        if (exitCode != 0 || !Utils::getIsAllowWindow()) {
-            Utils::mPrintlog("[launchService] send tcp reject data to phone \n");
+        Log::mPrintlog("[launchService] launch service is pcsuite \n");
+        if (exitCode != 0 || !ConnectionState::getIsAllowWindow()) {
+            Log::mPrintlog("[launchService] send tcp reject data to phone \n");
             co_await sendTcp(ConnectTag::REJECT, serviceId::pcsuiteId);
             co_return;
         }
-        Utils::mPrintlog("[launchService] send tcp agree data to phone \n");
+        Log::mPrintlog("[launchService] send tcp agree data to phone \n");
         co_await sendTcp(ConnectTag::AGREE, serviceId::pcsuiteId);
 
-        const long long seqNo = Utils::getNfcLanConnectSeqNo();
-        const bool autoConnect = Utils::getThisPhoneAutoConnect();
+        const long long seqNo = ConnectionState::getNfcLanConnectSeqNo();
+        const bool autoConnect = ConnectionState::getThisPhoneAutoConnect();
         auto handOver = [this, &localIp, &ip, &request, seqNo, autoConnect] {
             if (sendPhoneInfoToPcsuite(localIp, ip, request.deviceName, kConnectionMode, request.deviceId, seqNo,
                                        autoConnect, request.account, request.deviceType, request.openId)) {
-                Utils::mPrintlog(
+                Log::mPrintlog(
                     "[launchService] success to send phone info to pcsuite, by http request(9199), phone ip is: " + ip);
             } else {
-                Utils::mPrintlog(
+                Log::mPrintlog(
                     "[launchService] failed to send phone info to pcsuite by http request(9199), start pcsuite.exe \n");
                 startPcSuite(ip, request.deviceName, seqNo, kConnectionMode, request.deviceId, autoConnect,
                              request.account, request.openId, request.deviceType);
@@ -128,17 +131,17 @@ asio::awaitable<void> LaunchService::launchService(std::string ip, std::string l
         };
         co_await loop_.runBlocking(std::move(handOver));
     } else {
-        Utils::mPrintlog("[launchService] launch service is kesushare \n");
-        Utils::mPrintlog("[launchService] send tcp agree data to phone \n");
+        Log::mPrintlog("[launchService] launch service is kesushare \n");
+        Log::mPrintlog("[launchService] send tcp agree data to phone \n");
         co_await sendTcp(ConnectTag::AGREE, serviceId::shareId);
-        Utils::mPrintlog("[launchService] start to launch kesu share allowed window \n");
-        const long long seqNo = Utils::getNfcLanConnectSeqNo();
+        Log::mPrintlog("[launchService] start to launch kesu share allowed window \n");
+        const long long seqNo = ConnectionState::getNfcLanConnectSeqNo();
         auto showShareWindow = [this, &ip, &request, seqNo] {
             startKesuShareAllowedWindow(request.deviceName, request.deviceId, ip, request.openId, seqNo, request.port);
         };
         co_await loop_.runBlocking(std::move(showShareWindow));
     }
-    Utils::mPrintlog(
+    Log::mPrintlog(
         "[launchService] waiting for pcsuite/kesushare connecting websocket result by [reportNFCConnectResult] \n");
 }
 
@@ -159,17 +162,17 @@ int LaunchService::startAllowedWindow(AppSource appSource, const std::string& de
         if (stopped_) return -1;
         ++waiting_;  // from here on stopWaits() ends this wait
     }
-    Utils::mPrintlog("[startAllowedWindow] launchPath is: " + path + ", arguments is: " + describeList(arguments) +
+    Log::mPrintlog("[startAllowedWindow] launchPath is: " + path + ", arguments is: " + describeList(arguments) +
                      " \n");
     int exitCode = 0;
-    const bool started = Utils::startProcess(path, arguments, exitCode);
-    Utils::mPrintlog("[startAllowedWindow] exitCode is: " + std::to_string(exitCode) + "\n");
+    const bool started = process::startProcess(path, arguments, exitCode);
+    Log::mPrintlog("[startAllowedWindow] exitCode is: " + std::to_string(exitCode) + "\n");
     if (!started) {
         std::lock_guard<std::mutex> lock(waitMutex_);
         --waiting_;
         return -1;
     }
-    Utils::mPrintlog("[startAllowedWindow] Enter the allow window event waiting! \n");
+    Log::mPrintlog("[startAllowedWindow] Enter the allow window event waiting! \n");
     const bool answered = hAllowSemaphore().try_acquire_for(config.allowWindowTimeout);
     bool stopped = false;
     {
@@ -177,15 +180,15 @@ int LaunchService::startAllowedWindow(AppSource appSource, const std::string& de
         --waiting_;
         stopped = stopped_;
     }
-    Utils::mPrintlog(answered ? "[startAllowedWindow]allow window event success \n"
+    Log::mPrintlog(answered ? "[startAllowedWindow]allow window event success \n"
                               : "[startAllowedWindow]allow window event timedOut \n");
-    Utils::mPrintlog("[startAllowedWindow] Leave the allow window event waiting! \n");
+    Log::mPrintlog("[startAllowedWindow] Leave the allow window event waiting! \n");
 
-    if (!stopped && Utils::getIsAllowWindow()) {
-        Utils::mPrintlog("[startAllowedWindow] you have agree the allowed window! \n");
+    if (!stopped && ConnectionState::getIsAllowWindow()) {
+        Log::mPrintlog("[startAllowedWindow] you have agree the allowed window! \n");
         return 0;
     }
-    Utils::mPrintlog("[startAllowedWindow] you have refuse the allowed window! \n");
+    Log::mPrintlog("[startAllowedWindow] you have refuse the allowed window! \n");
     return -1;
 }
 
@@ -201,7 +204,7 @@ bool LaunchService::sendPhoneInfoToPcsuite(const std::string& localIp, const std
     // The PC suite has always been sent the byte count of the pretty-printed text in front of
     // the compact text.
     const std::string PosStr = std::to_string(json::pretty(jsonPostHttp).size()) + "#" + json::compact(jsonPostHttp);
-    Utils::mPrintlog("[SocketServer::sendPhoneInfoToPcsuite] PosStr to pcsuite is: " + PosStr);
+    Log::mPrintlog("[SocketServer::sendPhoneInfoToPcsuite] PosStr to pcsuite is: " + PosStr);
     if (localIp.empty()) return false;
     return RequestBase::urlSessionPost(PosStr, httpUrl(localIp, Config::current().pcsuitePort));
 }
@@ -213,11 +216,11 @@ bool LaunchService::startPcSuite(const std::string& ip, const std::string& devic
     const std::string path = rootedPath(Config::current().pcsuiteExecutable);
     const auto arguments = pcSuiteArguments(ip, deviceName, seqNo, connectionMode, deviceId, autoConnect, account,
                                             deviceType, sameAccountFlag(openId, accountOpenId()));
-    Utils::mPrintlog("[startPcSuite] launchPath is: " + path + ", arguments is: " + describeList(arguments) + " \n");
+    Log::mPrintlog("[startPcSuite] launchPath is: " + path + ", arguments is: " + describeList(arguments) + " \n");
     int exitCode = 0;
-    if (!Utils::startProcess(path, arguments, exitCode)) {
-        Utils::mPrintlog("[startPcSuite] exitCode is: " + std::to_string(exitCode) + "\n");
-        Utils::mPrintlog("[startPcSuite] start pcsuite failed \n");
+    if (!process::startProcess(path, arguments, exitCode)) {
+        Log::mPrintlog("[startPcSuite] exitCode is: " + std::to_string(exitCode) + "\n");
+        Log::mPrintlog("[startPcSuite] start pcsuite failed \n");
         return false;
     }
     return true;
@@ -245,12 +248,12 @@ bool LaunchService::startKesuShareAllowedWindow(const std::string& deviceName, c
     const std::string path = rootedPath(Config::current().connectStatusExecutable);
     const std::vector<std::string> arguments = {"2",     deviceName, deviceId, address, sameAccountFlag(openId, accountOpenId()),
                                                 current, std::to_string(seqNo), previous};
-    Utils::mPrintlog("[startKesuShareAllowedWindow] launchPath is: " + path +
+    Log::mPrintlog("[startKesuShareAllowedWindow] launchPath is: " + path +
                      ", arguments is: " + describeList(arguments) + " \n");
     int exitCode = 0;
-    const bool started = Utils::startProcess(path, arguments, exitCode);
-    Utils::mPrintlog("[startKesuShareAllowedWindow] exitCode is: " + std::to_string(exitCode) + "\n");
-    Utils::mPrintlog(started ? "[startKesuShareAllowedWindow] kesushare allowedWindow open success! \n"
+    const bool started = process::startProcess(path, arguments, exitCode);
+    Log::mPrintlog("[startKesuShareAllowedWindow] exitCode is: " + std::to_string(exitCode) + "\n");
+    Log::mPrintlog(started ? "[startKesuShareAllowedWindow] kesushare allowedWindow open success! \n"
                              : "[startKesuShareAllowedWindow] kesushare allowedWindow open failed! \n");
     return started;
 }

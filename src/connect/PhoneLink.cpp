@@ -6,7 +6,7 @@
 #include <asio/use_awaitable.hpp>
 
 #include "core/Config.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -135,7 +135,7 @@ asio::awaitable<PhoneLink::Read> PhoneLink::readFrame(Bytes& frame, Clock::time_
         auto next = cutter_.next();
         if (const std::size_t dropped = cutter_.takeDropped(); dropped > 0) {
             const bool oversized = cutter_.takeOversized();
-            Utils::mPrintlog("[PhoneLink::readFrame] " + peerAddress_ + " dropped " + std::to_string(dropped) +
+            Log::mPrintlog("[PhoneLink::readFrame] " + peerAddress_ + " dropped " + std::to_string(dropped) +
                              " bytes that are not a phone frame" +
                              (oversized ? " (a frame announced a body above " +
                                               std::to_string(Config::current().phoneFrameMaxBody) + " bytes)"
@@ -148,7 +148,7 @@ asio::awaitable<PhoneLink::Read> PhoneLink::readFrame(Bytes& frame, Clock::time_
         if (shut_) co_return Read::Shut;
         if (peerClosed_ || !socket_.is_open()) {
             if (const std::size_t rest = cutter_.buffered(); rest > 0) {
-                Utils::mPrintlog("[PhoneLink::readFrame] " + peerAddress_ + " dropped " + std::to_string(rest) +
+                Log::mPrintlog("[PhoneLink::readFrame] " + peerAddress_ + " dropped " + std::to_string(rest) +
                                  " bytes of an unfinished frame");
                 cutter_.clear();
             }

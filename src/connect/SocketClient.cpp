@@ -3,7 +3,8 @@
 #include "connect/ConnectMessage.h"
 #include "connect/PhoneFrame.h"
 #include "core/Json.h"
-#include "core/Utils.h"
+#include "connect/ConnectionState.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -11,10 +12,10 @@ asio::awaitable<bool> SocketClient::connect(std::uint16_t ConnectServerPort, std
                                             Clock::time_point deadline) {
     std::string error;
     if (!co_await link_.connect(std::move(host), ConnectServerPort, deadline, error)) {
-        Utils::mPrintlog("[TCP Positive Conn]Error occur during connect as: " + error);
+        Log::mPrintlog("[TCP Positive Conn]Error occur during connect as: " + error);
         co_return false;
     }
-    Utils::mPrintlog("[TCP Positive Conn] success, host: " + link_.localAddress() +
+    Log::mPrintlog("[TCP Positive Conn] success, host: " + link_.localAddress() +
                      ", port: " + std::to_string(link_.localPort()));
     co_return true;
 }
@@ -22,16 +23,16 @@ asio::awaitable<bool> SocketClient::connect(std::uint16_t ConnectServerPort, std
 void SocketClient::disConnectServer() {
     const bool wasConnected = link_.isConnected();
     link_.shut();
-    if (wasConnected) Utils::mPrintlog("[TCP Positive Conn] An unknown error, Execute down! disconenct now \n");
+    if (wasConnected) Log::mPrintlog("[TCP Positive Conn] An unknown error, Execute down! disconenct now \n");
 }
 
 asio::awaitable<bool> SocketClient::C2SsendMessage(const Bytes& message, Clock::time_point deadline) {
     std::string error;
     if (!co_await link_.writeAll(message, deadline, error)) {
-        Utils::mPrintlog("[TCP Positive Conn] An error, Execute down! error code: " + error + ", disconenct now \n");
+        Log::mPrintlog("[TCP Positive Conn] An error, Execute down! error code: " + error + ", disconenct now \n");
         co_return false;
     }
-    Utils::mPrintlog("[TCP Positive Conn] Client write tag 0 done \n");
+    Log::mPrintlog("[TCP Positive Conn] Client write tag 0 done \n");
     co_return true;
 }
 
@@ -41,22 +42,22 @@ asio::awaitable<bool> SocketClient::CFrSpullMessage(Clock::time_point deadline) 
     case PhoneLink::Read::Frame:
         break;
     case PhoneLink::Read::Closed:
-        Utils::mPrintlog("[TCP Positive Conn] An error, Execute down! error code: closed by the phone, disconenct now \n");
+        Log::mPrintlog("[TCP Positive Conn] An error, Execute down! error code: closed by the phone, disconenct now \n");
         co_return false;
     case PhoneLink::Read::TimedOut:
     case PhoneLink::Read::Shut:
         co_return false;
     }
-    Utils::mPrintlog("[TCP Positive Conn] Client read tag 0 done \n");
+    Log::mPrintlog("[TCP Positive Conn] Client read tag 0 done \n");
     const auto text = phoneAnswerText(frame);
     std::lock_guard<std::mutex> lock(mutex_);
     if (!text) {
         serverMessageReceive_ = "error parse";
-        Utils::mPrintlog("[TCP Positive Conn] data parser result failed \n");
+        Log::mPrintlog("[TCP Positive Conn] data parser result failed \n");
         co_return true;
     }
     serverMessageReceive_ = *text;
-    Utils::mPrintlog("[TCP Positive Conn] Receive data is: " + *text);
+    Log::mPrintlog("[TCP Positive Conn] Receive data is: " + *text);
     co_return true;
 }
 
@@ -75,16 +76,16 @@ asio::awaitable<ClientWorkAct::Outcome> ClientWorkAct::ClientReqServer(std::uint
                                                                        std::function<bool()> stopRequested) {
     auto stopped = [&] { return ClientShared->isDisconnected() || (stopRequested && stopRequested()); };
     if (!co_await ClientShared->connect(Port, std::move(ip), deadline)) {
-        Utils::setWlanConnState(false);
+        ConnectionState::setWlanConnState(false);
         if (stopped()) co_return Outcome::Stopped;
-        Utils::mPrintlog("[ClientReqServer] connect phone tcp server failed ...");
+        Log::mPrintlog("[ClientReqServer] connect phone tcp server failed ...");
         co_return Outcome::ConnectFailed;
     }
-    Utils::setWlanConnState(true);
+    ConnectionState::setWlanConnState(true);
     if (stopped()) co_return Outcome::Stopped;
 
     const std::string vaildJson = json::compact(connectRequestBody());
-    Utils::mPrintlog("[ClientReqServer] Send connect message to phone, vaildJson count: " +
+    Log::mPrintlog("[ClientReqServer] Send connect message to phone, vaildJson count: " +
                      std::to_string(vaildJson.size()) + ", vaildJson: " + vaildJson + " \n");
     const bool sent = co_await ClientShared->C2SsendMessage(buildPhoneFrame(vaildJson), deadline);
     if (stopped()) co_return Outcome::Stopped;

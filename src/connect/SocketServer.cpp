@@ -8,7 +8,8 @@
 #include "core/EventLoop.h"
 #include "core/Json.h"
 #include "core/Text.h"
-#include "core/Utils.h"
+#include "connect/ConnectionState.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -19,7 +20,7 @@ using namespace std::chrono_literals;
 // Frees the connection slot however the hand-over ends.
 class ConnectSlot {
 public:
-    ~ConnectSlot() { Utils::setIsCanConnectDevice(true); }
+    ~ConnectSlot() { ConnectionState::setIsCanConnectDevice(true); }
 };
 
 // How long stop() waits for the links' handlers to notice: they end at once unless a request
@@ -52,13 +53,13 @@ bool SocketServer::ConnectStatusGet() {
         if (!ec) acceptor_.listen(asio::socket_base::max_listen_connections, ec);
         if (!ec) port_ = acceptor_.local_endpoint(ec).port();
         if (ec) {
-            Utils::mPrintlog("[ConnectStatusGet] Error! Server failed to connect as an error get: " + ec.message());
+            Log::mPrintlog("[ConnectStatusGet] Error! Server failed to connect as an error get: " + ec.message());
             asio::error_code ignored;
             acceptor_.close(ignored);
             port_ = 0;
             return false;
         }
-        Utils::mPrintlog("[ConnectStatusGet] Server Socket is open and wait client's connect request");
+        Log::mPrintlog("[ConnectStatusGet] Server Socket is open and wait client's connect request");
         launch_.resume();
         startAccept();
         return true;
@@ -82,8 +83,8 @@ void SocketServer::stop() {
     launch_.stopWaits();
     // The handlers finish on the loop; there is nothing to wait for when it does not run.
     if (loop_.running() && !loop_.inLoop() && !waitForNoLinks(kStopWait))
-        Utils::mPrintlog("[SocketServer] " + std::to_string(linkCount()) + " links still ending after stop");
-    Utils::mPrintlog("[SocketServer] stopped listening for phones");
+        Log::mPrintlog("[SocketServer] " + std::to_string(linkCount()) + " links still ending after stop");
+    Log::mPrintlog("[SocketServer] stopped listening for phones");
 }
 
 std::size_t SocketServer::linkCount() const {
@@ -101,7 +102,7 @@ void SocketServer::startAccept() {
         if (ec == asio::error::operation_aborted || !acceptor_.is_open()) return;
         if (ec) {
             // Out of descriptors and the like: try again shortly instead of spinning.
-            Utils::mPrintlog("[SocketServer] accept failed: " + ec.message());
+            Log::mPrintlog("[SocketServer] accept failed: " + ec.message());
             retryTimer_.expires_after(100ms);
             retryTimer_.async_wait([this](const asio::error_code& waitError) {
                 if (!waitError && acceptor_.is_open()) startAccept();
@@ -115,12 +116,12 @@ void SocketServer::startAccept() {
 
 void SocketServer::onAccept(asio::ip::tcp::socket socket) {
     auto link = std::make_shared<PhoneLink>(std::move(socket));
-    Utils::mPrintlog("[SocketServer]Request Conn Comming,Client " + link->peerAddress() + ": " +
+    Log::mPrintlog("[SocketServer]Request Conn Comming,Client " + link->peerAddress() + ": " +
                      std::to_string(link->peerPort()) + " success connect: " + link->localAddress() + ": " +
                      std::to_string(link->localPort()) + " \n");
     const std::size_t maxLinks = Config::current().phoneServerMaxLinks;
     if (links_.size() >= maxLinks) {
-        Utils::mPrintlog("[SocketServer] " + link->peerAddress() + " refused: " + std::to_string(links_.size()) +
+        Log::mPrintlog("[SocketServer] " + link->peerAddress() + " refused: " + std::to_string(links_.size()) +
                          " links are open already");
         link->shut();
         return;
@@ -135,7 +136,7 @@ void SocketServer::onAccept(asio::ip::tcp::socket socket) {
             try {
                 std::rethrow_exception(failure);
             } catch (const std::exception& e) {
-                Utils::mPrintlog(std::string("[SocketServer] link handler failed: ") + e.what());
+                Log::mPrintlog(std::string("[SocketServer] link handler failed: ") + e.what());
             }
         }
         linkEnded(link);
@@ -158,25 +159,25 @@ asio::awaitable<void> SocketServer::handleLink(std::shared_ptr<PhoneLink> link) 
     case PhoneLink::Read::Frame: {
         const std::string body = phoneFrameBody(frame);
         if (!text::isValidUtf8(body)) {
-            Utils::mPrintlog("[SocketServer] didRead delegate, message from " + link->peerAddress() +
+            Log::mPrintlog("[SocketServer] didRead delegate, message from " + link->peerAddress() +
                              " is not UTF-8, dropped");
         } else {
-            Utils::mPrintlog("[SocketServer] didRead delegate,Recv message from phone: " + body);
+            Log::mPrintlog("[SocketServer] didRead delegate,Recv message from phone: " + body);
             if (auto request = PhoneConnectRequest::parse(body)) {
                 co_await handleRequest(*link, std::move(*request));
             } else {
-                Utils::mPrintlog("[SocketServer] message from " + link->peerAddress() +
+                Log::mPrintlog("[SocketServer] message from " + link->peerAddress() +
                                  " is not a connection request, dropped");
             }
         }
         break;
     }
     case PhoneLink::Read::TimedOut:
-        Utils::mPrintlog("[SocketServer] " + link->peerAddress() + " sent no request within " +
+        Log::mPrintlog("[SocketServer] " + link->peerAddress() + " sent no request within " +
                          std::to_string(readTimeout.count()) + " ms, link closed");
         break;
     case PhoneLink::Read::Closed:
-        Utils::mPrintlog("[SocketServer] " + link->peerAddress() + " closed the link without a request");
+        Log::mPrintlog("[SocketServer] " + link->peerAddress() + " closed the link without a request");
         break;
     case PhoneLink::Read::Shut:
         break;
@@ -188,35 +189,35 @@ asio::awaitable<void> SocketServer::handleRequest(PhoneLink& link, PhoneConnectR
     const std::string ip = link.peerAddress();
     const std::string localIp = link.localAddress();
     if (request.serviceId == rawValue(serviceId::pcsuiteId)) {
-        if (!Utils::tryClaimConnectDevice()) {
-            const ConnectTag tag = busyAnswerFor(Utils::getConnectingDeviceType(), request.deviceType);
+        if (!ConnectionState::tryClaimConnectDevice()) {
+            const ConnectTag tag = busyAnswerFor(ConnectionState::getConnectingDeviceType(), request.deviceType);
             if (tag == ConnectTag::DIFFDEVICEBUSY) {
-                Utils::mPrintlog(
+                Log::mPrintlog(
                     "[SocketServer] now connecting another different type device, send different device busy");
             } else {
-                Utils::mPrintlog("[SocketServer] now connecting another same type device, notify remote busy");
+                Log::mPrintlog("[SocketServer] now connecting another same type device, notify remote busy");
             }
             co_await sendTcp(link, tag, serviceId::pcsuiteId);
             co_return;
         }
         ConnectSlot slot;
-        Utils::setConnectingDeviceType(request.deviceType);
+        ConnectionState::setConnectingDeviceType(request.deviceType);
         co_await launch_.launchService(ip, localIp, AppSource::pcsuite, std::move(request), send);
     } else if (request.serviceId == rawValue(serviceId::shareId)) {
         co_await launch_.launchService(ip, localIp, AppSource::kesuShare, std::move(request), send);
     } else {
-        Utils::mPrintlog("[SocketServer] unknown service_id \"" + request.serviceId + "\" from " + ip +
+        Log::mPrintlog("[SocketServer] unknown service_id \"" + request.serviceId + "\" from " + ip +
                          ", request dropped");
     }
 }
 
 asio::awaitable<bool> SocketServer::sendTcp(PhoneLink& link, ConnectTag tag, serviceId id) {
     const std::string text = json::pretty(connectAnswerBody(tag, id));
-    Utils::mPrintlog("[SendTCP] the message to send is : " + text);
+    Log::mPrintlog("[SendTCP] the message to send is : " + text);
     std::string error;
     if (!co_await link.writeAll(buildPhoneFrame(text), PhoneLink::Clock::now() + Config::current().phoneAnswerWriteTimeout,
                                 error)) {
-        Utils::mPrintlog("[SendTCP] the answer could not be sent to " + link.peerAddress() + ": " + error);
+        Log::mPrintlog("[SendTCP] the answer could not be sent to " + link.peerAddress() + ": " + error);
         co_return false;
     }
     co_return true;

@@ -1,7 +1,7 @@
 #include "connect/Step.h"
 
 #include "connect/StepsConfig.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -30,13 +30,13 @@ void Step::init(std::string_view stepsJson, std::string_view os4StepsJson) {
     if (configParser(stepsJson, os4StepsJson)) {
         setIsParserConfigSucc(true);
     } else {
-        Utils::mPrintlog("[Step::init]: stepsConfig.json file content parser failed! Init step failed ...\r\n");
+        Log::mPrintlog("[Step::init]: stepsConfig.json file content parser failed! Init step failed ...\r\n");
     }
 }
 
 bool Step::configParser(std::string_view stepsJson, std::string_view os4StepsJson) {
     if (stepsJson.empty()) {
-        Utils::mPrintlog(
+        Log::mPrintlog(
             "[Step::configParser]: stepsConfig.json file content is nil or read stepsConfig.json file failed!\r\n");
         return false;
     }

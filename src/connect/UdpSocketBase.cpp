@@ -10,7 +10,7 @@
 #include <cstring>
 #include <system_error>
 
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -71,7 +71,7 @@ bool UdpSocketBase::initial(std::uint16_t port, const std::string& ip, int /*tim
         if (fd_ < 0 || ::connect(fd_, reinterpret_cast<const sockaddr*>(&peer), length) != 0) error = systemMessage(errno);
     }
     if (!error.empty()) {
-        Utils::mPrintlog("[UdpSocketBase::udpSocket] Error connecting to host: " + error);
+        Log::mPrintlog("[UdpSocketBase::udpSocket] Error connecting to host: " + error);
         if (fd_ >= 0) ::close(fd_);
         fd_ = -1;
         return false;
@@ -93,11 +93,11 @@ bool UdpSocketBase::sendMsg(double /*time*/, const Bytes& data) {
     if (error == 0 && ::send(fd_, data.data(), data.size(), MSG_DONTWAIT | MSG_NOSIGNAL) < 0) error = errno;
     if (error != 0) {
         const std::string reason = systemMessage(error);
-        Utils::mPrintlog("[UdpSocketBase::udpSocket] Failed to send message: " +
+        Log::mPrintlog("[UdpSocketBase::udpSocket] Failed to send message: " +
                          (reason.empty() ? std::string("Unknown error") : reason));
         return false;
     }
-    Utils::mPrintlog("[UdpSocketBase::udpSocket] Message sent");
+    Log::mPrintlog("[UdpSocketBase::udpSocket] Message sent");
     return true;
 }
 
@@ -105,6 +105,6 @@ bool UdpSocketBase::recvMsg(double /*time*/, Bytes& /*data*/, int& /*errorCode*/
 
 bool UdpSocketBase::isSocketNull() { return false; }
 
-std::string UdpSocketBase::getSokcetType() { return "udp"; }
+std::string UdpSocketBase::getSocketType() { return "udp"; }
 
 }  // namespace kesu

@@ -29,7 +29,7 @@ public:
     // Datagram links here only send: answers nothing and returns true.
     bool recvMsg(double time, Bytes& data, int& errorCode) override;
     bool isSocketNull() override;
-    std::string getSokcetType() override;  // "udp"
+    std::string getSocketType() override;  // "udp"
 
 private:
     std::mutex mutex_;     // guards the two below

@@ -13,7 +13,7 @@
 #include "control/ResponseHandler.h"
 #include "core/Config.h"
 #include "core/Text.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -32,12 +32,12 @@ std::string HttpService::handleBody(const std::string& body) {
         if (!text.empty()) request = RequestHandle().format(text);
         return text::lengthPrefixed(ResponseHandler::create(request));
     } catch (const std::exception& e) {
-        Utils::mPrintlog(std::string("[httpService] request failed: ") + e.what());
+        Log::mPrintlog(std::string("[httpService] request failed: ") + e.what());
         return {};
     }
 }
 
-bool HttpService::startHttpServic() {
+bool HttpService::startHttpService() {
     std::lock_guard<std::mutex> lock(mutex_);
     if (serve_) return true;
     const Config& config = Config::current();
@@ -100,7 +100,7 @@ bool HttpService::startHttpServic() {
         raw->listen_after_bind();
         ended->set_value();
     });
-    Utils::mPrintlog("[httpService]Run succ ");
+    Log::mPrintlog("[httpService]Run succ ");
     return true;
 }
 

@@ -27,7 +27,7 @@ public:
     static HttpService& httpService();
 
     // Creates and starts the server if there is none. False when it could not listen.
-    bool startHttpServic();
+    bool startHttpService();
     // Stops the server (if any) and waits for its listener to end.
     void stop();
     bool isRunning() const;

@@ -4,7 +4,7 @@
 
 #include <algorithm>
 
-#include "core/Utils.h"
+#include "core/Log.h"
 #include "platform/PeerOwner.h"
 
 namespace kesu {
@@ -17,10 +17,10 @@ bool PeerGate::admit(int fd) {
     if (owner && (*owner == self_ || *owner == 0)) return true;
     if (shouldLog(owner)) {
         if (owner) {
-            Utils::mPrintlog("[httpService] refused a control connection from uid " + std::to_string(*owner) +
+            Log::mPrintlog("[httpService] refused a control connection from uid " + std::to_string(*owner) +
                              ": not this service's user");
         } else {
-            Utils::mPrintlog("[httpService] refused a control connection: its owner is unknown (" + why + ")");
+            Log::mPrintlog("[httpService] refused a control connection: its owner is unknown (" + why + ")");
         }
     }
     return false;

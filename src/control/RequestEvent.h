@@ -52,7 +52,7 @@ RequestEvent requestEventFrom(std::string_view name);
 // A decoded control request.
 struct requestObj {
     RequestEvent event = RequestEvent::unknown;
-    std::optional<std::string> sourec;  // the sender's application ("app")
+    std::optional<std::string> source;  // the sender's application ("app")
     Json params = Json::array();        // object, array or string; [] when unusable
 };
 

@@ -1,6 +1,6 @@
 #include "control/RequestHandle.h"
 
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -32,7 +32,7 @@ requestObj RequestHandle::format(const std::string& requestStr) const {
     if (isEmpty(jsonText)) return request;
     const auto parsed = parseJson(jsonText);
     if (!parsed) {
-        Utils::mPrintlog("[formatRequest] jsonData is nil");
+        Log::mPrintlog("[formatRequest] jsonData is nil");
         return request;
     }
     const Json& envelope = *parsed;
@@ -46,7 +46,7 @@ requestObj RequestHandle::format(const std::string& requestStr) const {
     if (params.is_object() || params.is_array() || params.is_string()) request.params = std::move(params);
     if (envelope.is_object()) {
         auto app = envelope.find("app");
-        if (app != envelope.end() && app->is_string()) request.sourec = app->get<std::string>();
+        if (app != envelope.end() && app->is_string()) request.source = app->get<std::string>();
     }
     request.event = requestEventFrom(eventName);
     return request;

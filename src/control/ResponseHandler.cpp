@@ -5,12 +5,16 @@
 #include "cloud/KPushReceiveEventHandler.h"
 #include "connect/AllowWindow.h"
 #include "connect/ConnectCodes.h"
-#include "connect/Pcuitinterface.h"
+#include "connect/PcsuiteInterface.h"
 #include "connect/Step.h"
 #include "connect/UdpSocketBase.h"
 #include "core/Config.h"
 #include "core/Text.h"
-#include "core/Utils.h"
+#include "connect/ConnectionState.h"
+#include "core/Log.h"
+#include "core/Text.h"
+#include "pcsuite/PcsuiteClient.h"
+#include "platform/SystemInfo.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/StateCheck.h"
 #include "events/EventPublisher.h"
@@ -67,34 +71,34 @@ std::string busyConnectionReply() {
 }
 
 std::string connectSSDP(const requestObj& request) {
-    Utils::mPrintlog("Start the SSDP connect ...");
+    Log::mPrintlog("Start the SSDP connect ...");
     const Json& params = positional(request);
     if (params.empty()) return {};
     // Taking the slot is one atomic step: two simultaneous requests cannot both pass.
-    if (!Utils::tryClaimConnectDevice()) return busyConnectionReply();
+    if (!ConnectionState::tryClaimConnectDevice()) return busyConnectionReply();
     const std::string id = paramText(params, 0);
-    Utils::mPrintlog("SSDP connect to " + id + " ...");
-    const std::string result = Pcuitinterface().ActiveConnect(id);
-    Utils::setIsCanConnectDevice(true);
-    Utils::mPrintlog("SSDP connect to " + id + " end ...");
+    Log::mPrintlog("SSDP connect to " + id + " ...");
+    const std::string result = PcsuiteInterface().ActiveConnect(id);
+    ConnectionState::setIsCanConnectDevice(true);
+    Log::mPrintlog("SSDP connect to " + id + " end ...");
     return result;
 }
 
 std::string allowWindowAnswer(const requestObj& request, bool agree) {
-    Utils::mPrintlog(agree ? "QtWindow Agree Connect \n" : "QtWindow Refuse Connect \n");
+    Log::mPrintlog(agree ? "QtWindow Agree Connect \n" : "QtWindow Refuse Connect \n");
     const Json& params = positional(request);
-    if (agree && !params.empty()) Utils::setThisPhoneAutoConnect(paramText(params, 0) == "true");
-    Utils::setIsAllowWindow(agree);
+    if (agree && !params.empty()) ConnectionState::setThisPhoneAutoConnect(paramText(params, 0) == "true");
+    ConnectionState::setIsAllowWindow(agree);
     hAllowSemaphore().release();
     const Json record = {{"type", 1}, {"eventId", "W688|10160"}, {"params", {{"click", 1}}}};
     const std::string buryPointStr = "[" + pretty(record) + "]";
-    Utils::mPrintlog("[launchService] sendBuryPoint buryPointStr is: " + buryPointStr + " \n");
-    if (Utils::sendBuryPoint(buryPointStr)) Utils::mPrintlog("[launchService] sendBuryPoint success \n");
+    Log::mPrintlog("[launchService] sendBuryPoint buryPointStr is: " + buryPointStr + " \n");
+    if (PcsuiteClient::sendBuryPoint(buryPointStr)) Log::mPrintlog("[launchService] sendBuryPoint success \n");
     return ResponseHandler::response(0, agree ? "Close" : "Refuse");
 }
 
 std::string primaryBusyReply() {
-    const int error = Utils::getPrimaryConnectDeviceType() == "pad" ? rawValue(ErrorCode::PC_CONN_PAD_BUSY)
+    const int error = ConnectionState::getPrimaryConnectDeviceType() == "pad" ? rawValue(ErrorCode::PC_CONN_PAD_BUSY)
                                                                     : rawValue(ErrorCode::PC_CONN_PHONE_BUSY);
     return ResponseHandler::response(error, "PC_STATE_BUSY");
 }
@@ -102,41 +106,41 @@ std::string primaryBusyReply() {
 // The connection over a pre-connection, with the busy slot held for its whole length.
 std::string connectPreconnected(const Json& params, const std::string& id) {
     std::string deviceType = params.size() >= 3 ? paramText(params, 2) : std::string();
-    std::string autoConnectType = Utils::getPrimaryConnectDeviceType();
+    std::string autoConnectType = ConnectionState::getPrimaryConnectDeviceType();
     const std::string result = ConnectFlow().start(id, deviceType, autoConnectType);
     ReportDevicesV2::instance().notify();
-    Utils::setIsCanPrimaryConnectDevice(true);
+    ConnectionState::setIsCanPrimaryConnectDevice(true);
     return result;
 }
 
 std::string preconnectConnect(const requestObj& request) {
-    Utils::mPrintlog("[INTERACTION][PCSUITE_TO CONNSERVER] preconnect_connect Request ...");
+    Log::mPrintlog("[INTERACTION][PCSUITE_TO CONNSERVER] preconnect_connect Request ...");
     const Json& params = positional(request);
-    if (!Utils::getIsCanPrimaryConnectDevice()) return primaryBusyReply();
+    if (!ConnectionState::getIsCanPrimaryConnectDevice()) return primaryBusyReply();
     if (params.empty()) return {};
-    if (!Utils::tryClaimPrimaryConnectDevice()) return primaryBusyReply();
+    if (!ConnectionState::tryClaimPrimaryConnectDevice()) return primaryBusyReply();
     const std::string id = paramText(params, 0);
-    Utils::mPrintlog("preconnect_connect device id " + id);
+    Log::mPrintlog("preconnect_connect device id " + id);
     const std::string result = connectPreconnected(params, id);
-    Utils::mPrintlog("[RequestEvent::preconnect_connect] [INTERACTION][CONNSERVER_TO_PCSUITE] Connect " + id +
+    Log::mPrintlog("[RequestEvent::preconnect_connect] [INTERACTION][CONNSERVER_TO_PCSUITE] Connect " + id +
                      " end, strData is:  " + result);
     return result;
 }
 
 std::string preconnectPreconnectConnect(const requestObj& request) {
-    Utils::mPrintlog("preconnect_preconnect-connect Request ...");
+    Log::mPrintlog("preconnect_preconnect-connect Request ...");
     const Json& params = positional(request);
     if (params.empty()) return {};
     const std::string id = paramText(params, 0);
     StrategyDevicePreconnect::preconnectDeviceByDeviceId(id);
-    if (!Utils::tryClaimPrimaryConnectDevice()) return primaryBusyReply();
+    if (!ConnectionState::tryClaimPrimaryConnectDevice()) return primaryBusyReply();
     const std::string result = connectPreconnected(params, id);
-    Utils::mPrintlog("[RequestEvent::preconnect_connect] Connect " + id + " end, strData is:  " + result);
+    Log::mPrintlog("[RequestEvent::preconnect_connect] Connect " + id + " end, strData is:  " + result);
     return result;
 }
 
 std::string preconnectStartScan(const requestObj&) {
-    Utils::mPrintlog("preconnect_startScan Request ...");
+    Log::mPrintlog("preconnect_startScan Request ...");
     EventPublisher::instance().notifySubscribers(ServiceEvent::DeviceListUpdate);
     auto& registry = DeviceWaitForPreConnectManager::instance();
     registry.waitForDevices(Config::current().preconnectScanWait);  // ends as soon as one is there
@@ -149,7 +153,7 @@ std::string preconnectStartScan(const requestObj&) {
 }
 
 std::string preconnectPreconnect(const requestObj& request) {
-    Utils::mPrintlog("preconnect_preconnect Request ...");
+    Log::mPrintlog("preconnect_preconnect Request ...");
     const Json& params = positional(request);
     if (params.empty()) return {};
     const std::string id = paramString(params, 0);
@@ -157,17 +161,17 @@ std::string preconnectPreconnect(const requestObj& request) {
     if (!DeviceWaitForPreConnectManager::instance().lookupDevices(id, device))
         return ResponseHandler::response(rawValue(ErrorCode::NOT_FOUND), "Preconnect_preconnect device not found");
     if (device->getIsConnected()) {
-        Utils::mPrintlog(
+        Log::mPrintlog(
             "[StrategyDevicePreconnect::preconnectDeviceByDeviceId] This device is already preconnect success");
         return ResponseHandler::response(0, "This device is already preconnect");
     }
     return StrategyDevicePreconnect::preconnectDeviceByDeviceId(id)
                ? ResponseHandler::response(0, "Preconnect_preconnect success")
-               : ResponseHandler::response(rawValue(ErrorCode::UNKNOW), "Preconnect_preconnect failed");
+               : ResponseHandler::response(rawValue(ErrorCode::UNKNOWN), "Preconnect_preconnect failed");
 }
 
 std::string preconnectDisconnect(const requestObj& request) {
-    Utils::mPrintlog("preconnect_disconnect Request ...");
+    Log::mPrintlog("preconnect_disconnect Request ...");
     const Json& params = positional(request);
     if (!params.empty()) {
         DeviceWaitForPreConnectManager::Entry device;
@@ -179,8 +183,8 @@ std::string preconnectDisconnect(const requestObj& request) {
 }
 
 std::string connectCenterEvent(const requestObj& request, bool create) {
-    Utils::mPrintlog(create ? "connectCenterEventCreate Request ..." : "connectCenterEventReport Request ...");
-    if (!request.params.is_object()) return ResponseHandler::response(rawValue(ErrorCode::UNKNOW), "Parameter error");
+    Log::mPrintlog(create ? "connectCenterEventCreate Request ..." : "connectCenterEventReport Request ...");
+    if (!request.params.is_object()) return ResponseHandler::response(rawValue(ErrorCode::UNKNOWN), "Parameter error");
     Json data = request.params;
     data["userId"] = dataInstance().get(&databaseParam::openid);
     int status = 0;
@@ -191,7 +195,7 @@ std::string connectCenterEvent(const requestObj& request, bool create) {
     }
     return ConnectCenterRequest::createEvent(data, status, msg)
                ? ResponseHandler::response(0, "ConnectCenterEventCreate success")
-               : ResponseHandler::response(rawValue(ErrorCode::UNKNOW), "Created failed");
+               : ResponseHandler::response(rawValue(ErrorCode::UNKNOWN), "Created failed");
 }
 
 void sendClientIdQuery(const std::string& openid) {
@@ -204,18 +208,18 @@ void sendClientIdQuery(const std::string& openid) {
 }
 
 std::string accountChange(const requestObj& request) {
-    Utils::mPrintlog("account change ... \n");
+    Log::mPrintlog("account change ... \n");
     // The parameters hold the access token: it is logged masked.
     Json shown = request.params;
-    if (shown.is_array() && shown.size() > 1) shown[1] = Utils::paramAddMask(json::text(shown[1]));
-    Utils::mPrintlog("user info: " + json::compact(shown) + " \n");
+    if (shown.is_array() && shown.size() > 1) shown[1] = text::paramAddMask(json::text(shown[1]));
+    Log::mPrintlog("user info: " + json::compact(shown) + " \n");
     const Json& params = positional(request);
     if (params.size() >= 4) {
         const std::string openid = paramText(params, 0);
         dataInstance().update([&](databaseParam& p) {
             p.openid = openid;
             p.token = paramText(params, 1);
-            p.Phone = Utils::paramAddMask(paramText(params, 2));
+            p.Phone = text::paramAddMask(paramText(params, 2));
             p.storageDir = paramText(params, 3);
             if (!openid.empty()) {
                 p.lastOpenId = p.openid;
@@ -230,22 +234,22 @@ std::string accountChange(const requestObj& request) {
             EventPublisher::instance().notifySubscribers(ServiceEvent::AccountChange);
         }
     } else if (!params.empty()) {
-        Utils::mPrintlog("account change param error, nothing changed \n");
+        Log::mPrintlog("account change param error, nothing changed \n");
     }
     return ResponseHandler::response(0, "accountChange request success");
 }
 
 std::string historyPhoneChange(const requestObj& request) {
-    Utils::mPrintlog("historyPhoneChange ... \n");
-    Utils::mPrintlog("history device info: " + json::compact(request.params) + " \n");
+    Log::mPrintlog("historyPhoneChange ... \n");
+    Log::mPrintlog("history device info: " + json::compact(request.params) + " \n");
     const Json& params = positional(request);
-    if (params.empty()) return ResponseHandler::response(rawValue(ErrorCode::UNKNOW), "UNKNOWN");
+    if (params.empty()) return ResponseHandler::response(rawValue(ErrorCode::UNKNOWN), "UNKNOWN");
     if (params.size() == 2) {
         const std::string kind = paramText(params, 1);
         if (kind == "phone") dataInstance().set(&databaseParam::historyPhoneId, paramText(params, 0));
         else if (kind == "pad") dataInstance().set(&databaseParam::historyPadId, paramText(params, 0));
     } else {
-        Utils::mPrintlog("historyPhoneChange param error! \n");
+        Log::mPrintlog("historyPhoneChange param error! \n");
     }
     return ResponseHandler::response(0, "historyPhoneChange request success");
 }
@@ -259,40 +263,40 @@ std::string withData(int error, const std::string& message, Json data) {
 }  // namespace
 
 std::string ResponseHandler::structureQueryAdapterRes() {
-    const auto addresses = Utils::getNetworkCorrespondAddress();
+    const auto addresses = SystemInfo::getNetworkCorrespondAddress();
     Json ips = Json::array();
     for (const auto& [name, ip] : addresses)
         if (!ip.empty()) ips.push_back(ip);
     const Json data = {
         {"ble", false},
         {"ble_enable", false},
-        {"mac", Utils::getMacAddress()},
-        {"ssid", Utils::SsidWifiName()},
-        {"wiredNet", Utils::MacEthernetNetworkAvailability()},
+        {"mac", SystemInfo::getMacAddress()},
+        {"ssid", SystemInfo::SsidWifiName()},
+        {"wiredNet", SystemInfo::MacEthernetNetworkAvailability()},
         {"wiredNet_enable", addresses.count("Ethernet") > 0 && !addresses.at("Ethernet").empty()},
-        {"wlan", Utils::MacWifiNetworkAvailability()},
-        {"wlan_enable", Utils::SsidWifiCondition()},
-        {"vpn", Utils::isVpnOn()},
+        {"wlan", SystemInfo::MacWifiNetworkAvailability()},
+        {"wlan_enable", SystemInfo::SsidWifiCondition()},
+        {"vpn", SystemInfo::isVpnOn()},
         {"pc_ip", ips},
         {"ble_model", ""},
         {"ble_version", ""},
         {"wlan_model", ""},
         {"if_same_wlan", -1},
     };
-    Utils::mPrintlog(json::compact(data));
+    Log::mPrintlog(json::compact(data));
     return withData(0, "", data);
 }
 
 std::string ResponseHandler::querySystemStatus() {
     const Json data = {
-        {"firewall", Utils::getFirewallState().value_or(false)},
+        {"firewall", SystemInfo::getFirewallState().value_or(false)},
         {"hotspot_fre", ""},
         {"hotspot_share", ""},
         {"projection_com", ""},
         {"if_support_5g", -1},
         {"wifi_info", Json::object()},
     };
-    Utils::mPrintlog(json::compact(data));
+    Log::mPrintlog(json::compact(data));
     return withData(0, "", data);
 }
 
@@ -304,21 +308,21 @@ std::string ResponseHandler::create(const requestObj& request) {
         case RequestEvent::unknown:
             return {};
         case RequestEvent::queryAdapter:
-            Utils::mPrintlog("Query adapter info ...");
+            Log::mPrintlog("Query adapter info ...");
             return structureQueryAdapterRes();
         case RequestEvent::SSDPQueryAll: {
-            Utils::mPrintlog("SSDPQueryAll");
+            Log::mPrintlog("SSDPQueryAll");
             std::string res;
             SsdpDeviceManager::instance().getQueryAll(res);
             return res;
         }
         case RequestEvent::startSSDPScan:
-            Utils::mPrintlog("startSSDPScan ");
+            Log::mPrintlog("startSSDPScan ");
             WlanDetectedDeviceCompare::instance().notifySubscribers();
             return withData(0, "", "");
         case RequestEvent::cancelSSDPConnect:
             SSDPcancel() = true;
-            Utils::mPrintlog("cancelSSDPConnect end ...");
+            Log::mPrintlog("cancelSSDPConnect end ...");
             return response(0, "");
         case RequestEvent::connectSSDP:
             return connectSSDP(request);
@@ -327,19 +331,19 @@ std::string ResponseHandler::create(const requestObj& request) {
         case RequestEvent::QtRefuse:
             return allowWindowAnswer(request, false);
         case RequestEvent::HeartBeat:
-            Utils::mPrintlog("http HeartBeat \n");
+            Log::mPrintlog("http HeartBeat \n");
             return withData(0, "", "Alive");
         case RequestEvent::LaunchSuccess:
-            Utils::mPrintlog("http LaunchSuccess: launch connectstatus windows success! \n");
+            Log::mPrintlog("http LaunchSuccess: launch connectstatus windows success! \n");
             return {};
         case RequestEvent::AlreadyStart:
-            Utils::mPrintlog("http AlreadyStart: connectstatus windows has already exist! \n");
+            Log::mPrintlog("http AlreadyStart: connectstatus windows has already exist! \n");
             return {};
         case RequestEvent::open:
-            Utils::mPrintlog("Open wifi setting ... \n");
-            return Utils::openWlanSetting();
+            Log::mPrintlog("Open wifi setting ... \n");
+            return SystemInfo::openWlanSetting();
         case RequestEvent::preconnect_enterConnectCenter:
-            Utils::mPrintlog("preconnect_enterConnectCenter Request ...");
+            Log::mPrintlog("preconnect_enterConnectCenter Request ...");
             EventPublisher::instance().notifySubscribers(ServiceEvent::Pcsuite);
             return response(0, "Preconnect_enterConnectCenter success");
         case RequestEvent::preconnect_startScan:
@@ -351,7 +355,7 @@ std::string ResponseHandler::create(const requestObj& request) {
         case RequestEvent::preconnect_disconnect:
             return preconnectDisconnect(request);
         case RequestEvent::preconnect_cancel:
-            Utils::mPrintlog("preconnect_cancel Request ...");
+            Log::mPrintlog("preconnect_cancel Request ...");
             StateCheck::instance().setPrimaryConnectCancel(true);
             return response(0, "Preconnect_cancel success");
         case RequestEvent::connectCenterEventReport:
@@ -359,16 +363,16 @@ std::string ResponseHandler::create(const requestObj& request) {
         case RequestEvent::connectCenterEventCreate:
             return connectCenterEvent(request, true);
         case RequestEvent::kpush:
-            Utils::mPrintlog("kpush Request ...");
-            Utils::mPrintlog("kpush data is " + json::compact(request.params));
+            Log::mPrintlog("kpush Request ...");
+            Log::mPrintlog("kpush data is " + json::compact(request.params));
             return KPushReceiveEventHandler::instance().kpushInfoHandler(request);
         case RequestEvent::enable:
-            Utils::mPrintlog("enable request, open wifi switch ... \n");
-            return response(0, Utils::openWifi() ? "enable wifi success" : "enable wifi failed");
+            Log::mPrintlog("enable request, open wifi switch ... \n");
+            return response(0, SystemInfo::openWifi() ? "enable wifi success" : "enable wifi failed");
         case RequestEvent::accountChange:
             return accountChange(request);
         case RequestEvent::getSystemStatus:
-            Utils::mPrintlog("getSystemStatus Request ... \n");
+            Log::mPrintlog("getSystemStatus Request ... \n");
             return querySystemStatus();
         case RequestEvent::preconnect_preconnect_connect:
             return preconnectPreconnectConnect(request);

@@ -5,7 +5,7 @@
 #include <exception>
 #include <string>
 
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -26,7 +26,7 @@ void EventLoop::start() {
                 break;
             } catch (const std::exception& e) {
                 // One handler's failure must not end the whole service's loop.
-                Utils::mPrintlog(std::string("[EventLoop] handler failed: ") + e.what());
+                Log::mPrintlog(std::string("[EventLoop] handler failed: ") + e.what());
             }
         }
         loopThread_.store(std::thread::id());

@@ -8,7 +8,8 @@
 #include "control/HttpService.h"
 #include "core/Config.h"
 #include "core/EventLoop.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "pcsuite/PcsuiteClient.h"
 
 namespace kesu {
 
@@ -25,14 +26,14 @@ struct HttpAliveCheck::State : std::enable_shared_from_this<State> {
         auto self = shared_from_this();
         loop.offload([self] { return self->probe(); }, [self](bool alive) {
             if (alive || self->isStopped()) return self->finish(false);
-            Utils::mPrintlog("[CheckHttpAlive::keepCheckHttpAlive] Http is stop! Restart http service!");
+            Log::mPrintlog("[CheckHttpAlive::keepCheckHttpAlive] Http is stop! Restart http service!");
             self->loop.offload([] { HttpService::httpService().stop(); }, [self] {
                 if (self->isStopped()) return self->finish(false);
                 self->pause.expires_after(Config::current().httpRestartPause);
                 self->pause.async_wait([self](const std::error_code& error) {
                     if (error || self->isStopped()) return self->finish(false);
                     // A failure to start is retried next round.
-                    self->loop.offload([] { HttpService::httpService().startHttpServic(); },
+                    self->loop.offload([] { HttpService::httpService().startHttpService(); },
                                        [self] { self->finish(true); });
                 });
             });
@@ -62,7 +63,7 @@ struct HttpAliveCheck::State : std::enable_shared_from_this<State> {
 
 HttpAliveCheck::HttpAliveCheck(EventLoop& loop, std::function<bool()> probe)
     : state_(std::make_shared<State>(loop, probe ? std::move(probe)
-                                                 : std::function<bool()>([] { return Utils::isHttpAlive(); }))),
+                                                 : std::function<bool()>([] { return PcsuiteClient::isHttpAlive(); }))),
       timer_(loop.context(), [] { return Config::current().httpWatchdogPeriod; },
              [state = state_] { state->check(); }) {
     timer_.start();

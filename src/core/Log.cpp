@@ -15,7 +15,7 @@
 
 #include "core/Config.h"
 #include "core/TimeUtil.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -71,7 +71,7 @@ public:
 
 protected:
     void sink_it_(const spdlog::details::log_msg& msg) override {
-        const std::string path = Utils::logFilePath(msg.time);
+        const std::string path = Log::logFilePath(msg.time);
         const std::uintmax_t limit = Config::current().logFileMaxBytes;
         if (path != openPath_) {
             close();
@@ -138,42 +138,24 @@ LogState& logState() {
     return *state;
 }
 
-std::mutex clockLock;
-std::function<Utils::Clock::time_point()> clockOverride;
-std::atomic<bool> clockOverridden{false};
-
 }  // namespace
 
-Utils::Clock::time_point Utils::now() {
-    if (clockOverridden.load(std::memory_order_acquire)) {
-        std::lock_guard<std::mutex> lock(clockLock);
-        if (clockOverride) return clockOverride();
-    }
-    return Clock::now();
-}
+std::string Log::libraryBase() { return homeDirectory() + "/Library/"; }
 
-void Utils::setClock(std::function<Clock::time_point()> clock) {
-    std::lock_guard<std::mutex> lock(clockLock);
-    clockOverride = std::move(clock);
-    clockOverridden.store(static_cast<bool>(clockOverride), std::memory_order_release);
-}
-
-std::string Utils::libraryBase() { return homeDirectory() + "/Library/"; }
-
-std::string Utils::logDirectory() {
+std::string Log::logDirectory() {
     return libraryBase() + "Application Support/pcsuite/log" + "/KesuConnService_log";
 }
 
-std::string Utils::logFilePath(Clock::time_point at) {
+std::string Log::logFilePath(WallClock::Clock::time_point at) {
     return libraryBase() + "Application Support/pcsuite/log" + rawValue(submoduleName::ConnectName) +
            timeutil::formatGmtDate(at) + ".log";
 }
 
-void Utils::mPrintlog(const std::string& output) {
+void Log::mPrintlog(const std::string& output) {
     LogState& state = logState();
     std::lock_guard<std::mutex> lock(state.printLock);
     try {
-        const auto at = now();
+        const auto at = WallClock::now();
         state.logger->log(at, spdlog::source_loc{}, spdlog::level::debug, output);
         // The file has just been capped: standard output learns it too.
         if (const auto notice = state.fileSink->takeCapNotice())
@@ -184,7 +166,7 @@ void Utils::mPrintlog(const std::string& output) {
     }
 }
 
-void Utils::closeLog() {
+void Log::closeLog() {
     LogState& state = logState();
     std::lock_guard<std::mutex> lock(state.printLock);
     state.logger->flush();
@@ -192,13 +174,7 @@ void Utils::closeLog() {
     std::fflush(stdout);
 }
 
-std::string Utils::getNowTime() { return timeutil::formatLocal(now()); }
-
-double Utils::currentTimeStamp() {
-    return std::chrono::duration<double>(now().time_since_epoch()).count();
-}
-
-void Utils::deleteOldLogFile() {
+void Log::deleteOldLogFile() {
     const std::string dir = logDirectory();
     std::error_code ec;
     fs::directory_iterator it(dir, ec);
@@ -207,7 +183,7 @@ void Utils::deleteOldLogFile() {
         return;
     }
     const std::string prefix = "KesuConnService_";
-    const auto today = timeutil::parseLocalDate(timeutil::formatLocalDate(now())).value_or(now());
+    const auto today = timeutil::parseLocalDate(timeutil::formatLocalDate(WallClock::now())).value_or(WallClock::now());
     for (; it != fs::directory_iterator(); it.increment(ec)) {
         if (ec) break;
         const std::string name = it->path().filename().string();
@@ -219,19 +195,19 @@ void Utils::deleteOldLogFile() {
         if (start == std::string::npos || end == std::string::npos) continue;
         const auto dateStart = start + prefix.size();
         if (end < dateStart) continue;  // ".log" before the prefix ends: no date range
-        const auto fileDate = timeutil::parseLocalDate(name.substr(dateStart, end - dateStart)).value_or(now());
+        const auto fileDate = timeutil::parseLocalDate(name.substr(dateStart, end - dateStart)).value_or(WallClock::now());
         if (timeutil::wholeDays(fileDate, today) <= logTimeOut) continue;
         std::error_code removeError;
         if (fs::remove(full, removeError) && !removeError)
-            mPrintlog("[Utils::deleteOldLogFile] " + name + " is time out, success to remove file.");
+            mPrintlog("[Log::deleteOldLogFile] " + name + " is time out, success to remove file.");
         else
-            mPrintlog("[Utils::deleteOldLogFile] " + name + " is time out, failed to remove file.");
+            mPrintlog("[Log::deleteOldLogFile] " + name + " is time out, failed to remove file.");
     }
 }
 
-void Utils::writeConnServiceVersion(const std::string& version) {
+void Log::writeConnServiceVersion(const std::string& version) {
     const std::string path = rootedPath(Config::current().versionFile);
-    const nlohmann::json content = {{"version", version}, {"updateTime", getNowTime()}};
+    const nlohmann::json content = {{"version", version}, {"updateTime", WallClock::getNowTime()}};
     const std::string text = content.dump(2);
     std::error_code ec;
     fs::create_directories(fs::path(path).parent_path(), ec);
@@ -239,9 +215,9 @@ void Utils::writeConnServiceVersion(const std::string& version) {
     if (out) out << text;
     if (out) out.flush();
     if (out) {
-        mPrintlog("[Utils::writeConnServiceVersion] file is exist and write content is: " + text + " ...");
+        mPrintlog("[Log::writeConnServiceVersion] file is exist and write content is: " + text + " ...");
     } else {
-        mPrintlog("[Utils::writeConnServiceVersion] try to write, error is: " +
+        mPrintlog("[Log::writeConnServiceVersion] try to write, error is: " +
                   std::string(ec ? ec.message() : std::strerror(errno)) + " ...");
     }
 }

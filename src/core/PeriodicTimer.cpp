@@ -6,7 +6,7 @@
 #include <exception>
 #include <string>
 
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -28,7 +28,7 @@ struct PeriodicTimer::State : std::enable_shared_from_this<State> {
         try {
             tick();
         } catch (const std::exception& e) {
-            Utils::mPrintlog(std::string("[PeriodicTimer] tick failed: ") + e.what());
+            Log::mPrintlog(std::string("[PeriodicTimer] tick failed: ") + e.what());
         }
         if (running.load()) arm(period());
     }

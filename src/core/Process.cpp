@@ -1,5 +1,7 @@
 #include "core/Process.h"
 
+#include "core/Log.h"
+
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
@@ -278,6 +280,17 @@ std::optional<std::string> runCapture(const std::string& path, const std::vector
     auto result = run(path, args, timeout);
     if (!result || result->timedOut) return std::nullopt;
     return std::move(result->output);
+}
+
+bool startProcess(const std::string& launchPath, const std::vector<std::string>& arguments, int& exitCode) {
+    std::string error;
+    if (!spawnDetached(launchPath, arguments, error)) {
+        exitCode = -1;
+        Log::mPrintlog("[startProcess] something went wrong, error: " + error);
+        return false;
+    }
+    exitCode = 0;
+    return true;
 }
 
 }  // namespace kesu::process

@@ -51,4 +51,11 @@ std::optional<int> runAndWait(const std::string& path, const std::vector<std::st
 // match in PATH, then in the standard system folders (sbin included); nullopt when none.
 std::optional<std::string> findProgram(const std::string& name);
 
+// spawnDetached with a logged failure: `exitCode` 0 when started, -1 when not.
+bool startProcess(const std::string& launchPath, const std::vector<std::string>& arguments, int& exitCode);
+
+// Starts a fresh copy of the service in place of this process. Returns only when that
+// could not be done, in which case this process keeps running.
+void restartService();
+
 }  // namespace kesu::process

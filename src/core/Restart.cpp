@@ -12,7 +12,8 @@
 #include <string>
 
 #include "core/Config.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "core/Process.h"
 
 namespace kesu {
 
@@ -44,19 +45,19 @@ std::string ownExecutable() {
 
 }  // namespace
 
-void Utils::restartService() {
-    mPrintlog("[Utils::restartService] restart KesuConnService");
+void process::restartService() {
+    Log::mPrintlog("[Utils::restartService] restart KesuConnService");
     std::string target = rootedPath(Config::current().serviceExecutable);
     if (access(target.c_str(), X_OK) != 0) {
         const std::string self = ownExecutable();
-        mPrintlog("[Utils::restartService] " + target + " is not executable, restart " + self);
+        Log::mPrintlog("[Utils::restartService] " + target + " is not executable, restart " + self);
         target = self;
     }
     if (target.empty()) {
-        mPrintlog("[Utils::restartService] no executable to restart, keep running");
+        Log::mPrintlog("[Utils::restartService] no executable to restart, keep running");
         return;
     }
-    closeLog();
+    Log::closeLog();
     markDescriptorsCloseOnExec();
     sigset_t none;
     sigemptyset(&none);
@@ -66,7 +67,7 @@ void Utils::restartService() {
     execv(target.c_str(), argv);
     const int err = errno;
     pthread_sigmask(SIG_SETMASK, &previous, nullptr);
-    mPrintlog("[Utils::restartService] restart failed: " + std::string(std::strerror(err)) + ", keep running");
+    Log::mPrintlog("[Utils::restartService] restart failed: " + std::string(std::strerror(err)) + ", keep running");
 }
 
 }  // namespace kesu

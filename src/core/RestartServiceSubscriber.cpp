@@ -3,17 +3,21 @@
 #include "core/Config.h"
 #include "core/Json.h"
 #include "core/TimeUtil.h"
-#include "core/Utils.h"
+#include "connect/ConnectionState.h"
+#include "core/Files.h"
+#include "core/Log.h"
+#include "core/Process.h"
+#include "core/WallClock.h"
 
 namespace kesu {
 
 RestartServiceSubscriber::RestartServiceSubscriber(EventLoop& loop) : IEventSubscriber(loop, {ServiceEvent::LogOn}) {}
 
 void RestartServiceSubscriber::eventNotify(ServiceEvent) {
-    if (Utils::getIsCanConnectDevice() && connServiceRunOutOfDate()) Utils::restartService();
+    if (ConnectionState::getIsCanConnectDevice() && connServiceRunOutOfDate()) process::restartService();
 }
 
-std::optional<Utils::Clock::time_point> RestartServiceSubscriber::versionUpdateTime(const std::string& content) {
+std::optional<WallClock::Clock::time_point> RestartServiceSubscriber::versionUpdateTime(const std::string& content) {
     const auto parsed = json::parse(content);
     const std::string updateText = parsed ? json::str(*parsed, "updateTime") : std::string();
     return timeutil::parseLocal(updateText);
@@ -21,16 +25,16 @@ std::optional<Utils::Clock::time_point> RestartServiceSubscriber::versionUpdateT
 
 bool RestartServiceSubscriber::connServiceRunOutOfDate() {
     std::string content;
-    Utils::readFile(rootedPath(Config::current().versionFile), content);
+    Files::readFile(rootedPath(Config::current().versionFile), content);
     if (content.empty()) return false;
     const auto updateTime = versionUpdateTime(content);
-    const auto now = timeutil::parseLocal(Utils::getNowTime());
+    const auto now = timeutil::parseLocal(WallClock::getNowTime());
     if (!updateTime || !now) {
-        Utils::mPrintlog("[RestartServiceSubscriber::connServiceRunOutOfDate] no valid updateTime, keep running");
+        Log::mPrintlog("[RestartServiceSubscriber::connServiceRunOutOfDate] no valid updateTime, keep running");
         return false;
     }
     const long long days = timeutil::wholeDays(*updateTime, *now);
-    Utils::mPrintlog("[RestartServiceSubscriber::connServiceRunOutOfDate] Now connservice run " +
+    Log::mPrintlog("[RestartServiceSubscriber::connServiceRunOutOfDate] Now connservice run " +
                      std::to_string(days) + " day ");
     return days > restartServiceDay;
 }

@@ -5,7 +5,7 @@
 #include <optional>
 #include <string>
 
-#include "core/Utils.h"
+#include "core/WallClock.h"
 #include "events/IEventSubscriber.h"
 
 namespace kesu {
@@ -19,7 +19,7 @@ public:
     // back. A missing, empty or unparsable file counts as current.
     bool connServiceRunOutOfDate();
     // The "updateTime" of the version file's text; nothing when the text holds no valid one.
-    static std::optional<Utils::Clock::time_point> versionUpdateTime(const std::string& content);
+    static std::optional<WallClock::Clock::time_point> versionUpdateTime(const std::string& content);
 
     const int restartServiceDay = 7;
 };

@@ -12,7 +12,9 @@
 #include "core/HttpAliveCheck.h"
 #include "core/ServiceManager.h"
 #include "core/SingleInstance.h"
-#include "core/Utils.h"
+#include "core/Endpoints.h"
+#include "core/Log.h"
+#include "platform/SystemInfo.h"
 
 namespace kesu {
 
@@ -26,17 +28,17 @@ int runService() {
     pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
     signal(SIGPIPE, SIG_IGN);
 
-    if (!processName(Utils::moduleName)) {
-        Utils::mPrintlog("[服务启动] 服务已存在，终止操作");
-        Utils::closeLog();
+    if (!processName(Log::moduleName)) {
+        Log::mPrintlog("[服务启动] 服务已存在，终止操作");
+        Log::closeLog();
         return 0;
     }
-    Utils::mPrintlog("[服务启动] 服务未存在，拉起服务");
-    Utils::getConnectCenterUrl();
-    Utils::writeConnServiceVersion(Utils::versionCode);
-    Utils::deleteOldLogFile();
-    Utils::GetPcSystemInfo();
-    HttpService::httpService().startHttpServic();
+    Log::mPrintlog("[服务启动] 服务未存在，拉起服务");
+    Endpoints::getConnectCenterUrl();
+    Log::writeConnServiceVersion(Log::versionCode);
+    Log::deleteOldLogFile();
+    SystemInfo::GetPcSystemInfo();
+    HttpService::httpService().startHttpService();
     EventLoop loop;
     loop.start();
     fileMonitorStart(loop);
@@ -49,14 +51,14 @@ int runService() {
     int signalNumber = 0;
     while (sigwait(&stopSignals, &signalNumber) != 0) {
     }
-    Utils::mPrintlog("[服务启动] signal " + std::string(strsignal(signalNumber)) + " received, stopping");
+    Log::mPrintlog("[服务启动] signal " + std::string(strsignal(signalNumber)) + " received, stopping");
     watchdog.stop();
     manager.stop();
     fileMonitorStop();
     HttpService::httpService().stop();
     loop.stop();
-    Utils::mPrintlog("[服务启动] stopped");
-    Utils::closeLog();
+    Log::mPrintlog("[服务启动] stopped");
+    Log::closeLog();
     return 0;
 }
 

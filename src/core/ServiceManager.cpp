@@ -1,13 +1,13 @@
 #include "core/ServiceManager.h"
 
-#include "connect/Pcuitinterface.h"
+#include "connect/PcsuiteInterface.h"
 #include "connect/SocketServer.h"
 #include "core/Config.h"
 #include "core/EventLoop.h"
 #include "core/RestartServiceSubscriber.h"
 #include "events/EventDetected.h"
 #include "events/SystemEventSubscriber.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 #include "discovery/ServiceWorker.h"
 #include "pcsuite/DeviceReports.h"
 #include "events/EventPublisher.h"
@@ -21,14 +21,14 @@ ServiceManager::~ServiceManager() { stop(); }
 void ServiceManager::start() {
     if (started_) return;
     started_ = true;
-    Utils::mPrintlog("[Server Start]this is ServiceManager \n");
+    Log::mPrintlog("[Server Start]this is ServiceManager \n");
 
     // LAN discovery (adapter check and announcement loop), then the pre-connection scheduler.
     serviceWorker_ = std::make_unique<ServiceWorker>(loop_);
     serviceWorker_->start();
 
     // The server for phone-initiated connections, and the PC-initiated ones, on the loop.
-    Pcuitinterface::setLoop(&loop_);
+    PcsuiteInterface::setLoop(&loop_);
     phoneServer_ = std::make_unique<SocketServer>(loop_);
     ServerWorkAct(*phoneServer_).ServerAccept();
 
@@ -58,7 +58,7 @@ void ServiceManager::stop() {
     serviceWorker_.reset();
     if (phoneServer_) phoneServer_->stop();
     phoneServer_.reset();
-    Pcuitinterface::setLoop(nullptr);
+    PcsuiteInterface::setLoop(nullptr);
     eventDetected_.reset();
     EventPublisher::instance().clearObservers();
     for (const auto& subscriber : subscribers_) subscriber->stop(std::chrono::seconds(5));

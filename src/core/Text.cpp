@@ -97,4 +97,45 @@ std::string trim(std::string_view s) {
 
 bool contains(std::string_view s, std::string_view part) { return s.find(part) != std::string_view::npos; }
 
+namespace {
+
+void appendUtf8(std::string& out, unsigned codePoint) {
+    if (codePoint < 0x80) {
+        out.push_back(static_cast<char>(codePoint));
+    } else {
+        out.push_back(static_cast<char>(0xC0 | (codePoint >> 6)));
+        out.push_back(static_cast<char>(0x80 | (codePoint & 0x3F)));
+    }
+}
+
+}  // namespace
+
+std::string paramAddMask(const std::string& str) {
+    const auto chars = graphemes(str);
+    if (chars.size() < 7) return str;
+    std::string masked;
+    for (std::size_t i = 0; i < 3; ++i) masked += chars[i];
+    masked += "****";
+    for (std::size_t i = chars.size() - 3; i < chars.size(); ++i) masked += chars[i];
+    return masked;
+}
+
+std::string uintToHexString(const std::string& value) {
+    static const char digits[] = "0123456789abcdef";
+    std::string hex;
+    hex.reserve(value.size() * 2);
+    for (unsigned char byte : value) {
+        hex.push_back(digits[byte >> 4]);
+        hex.push_back(digits[byte & 0x0F]);
+    }
+    return hex;
+}
+
+std::string asciiToString(const std::vector<std::uint8_t>& inBody) {
+    std::string out;
+    out.reserve(inBody.size());
+    for (std::uint8_t byte : inBody) appendUtf8(out, byte);
+    return out;
+}
+
 }  // namespace kesu::text

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -26,5 +27,13 @@ std::size_t jsonNestingDepth(std::string_view s);
 std::string trim(std::string_view s);
 
 bool contains(std::string_view s, std::string_view part);
+
+// A name or number shown in logs and lists: its first and last three characters around
+// "****" when it has seven or more characters, else unchanged.
+std::string paramAddMask(const std::string& str);
+// Every byte as two lowercase hex digits.
+std::string uintToHexString(const std::string& value);
+// Every byte read as a Latin-1 character, in UTF-8.
+std::string asciiToString(const std::vector<std::uint8_t>& inBody);
 
 }  // namespace kesu::text

@@ -7,7 +7,8 @@
 #include "core/Config.h"
 #include "core/EventLoop.h"
 #include "core/Json.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "platform/SystemInfo.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/SsdpMessage.h"
 #include "events/EventPublisher.h"
@@ -56,7 +57,7 @@ KesuAdapterManager::~KesuAdapterManager() {
     });
 }
 
-void KesuAdapterManager::creatAdapterSocket() {
+void KesuAdapterManager::createAdapterSocket() {
     loop_.call([this] { createSockets(); });
 }
 
@@ -99,19 +100,19 @@ std::map<std::string, std::string> KesuAdapterManager::networkStatus() {
     return loop_.call([this] { return netStatus; }).value_or(std::map<std::string, std::string>());
 }
 
-bool KesuAdapterManager::isWiFiEnabled() { return Utils::SsidWifiCondition(); }
+bool KesuAdapterManager::isWiFiEnabled() { return SystemInfo::SsidWifiCondition(); }
 
 // ---- On the loop ---------------------------------------------------------------------------
 
 void KesuAdapterManager::createSockets() {
-    const std::map<std::string, std::string> snapshot = Utils::getNetworkCorrespondAddress();
-    const std::string wifiName = Utils::GetWifiName();
-    const std::string ethernetName = Utils::GetEthernetName();
+    const std::map<std::string, std::string> snapshot = SystemInfo::getNetworkCorrespondAddress();
+    const std::string wifiName = SystemInfo::GetWifiName();
+    const std::string ethernetName = SystemInfo::GetEthernetName();
     netStatus = snapshot;
     active_ = true;
     // The first "blocked socket" check comes a whole time-out after the start.
     devices_.markOwnEcho();
-    Utils::mPrintlog(" [netcard status] Currently network card status:" + json::pretty(Json(snapshot)));
+    Log::mPrintlog(" [netcard status] Currently network card status:" + json::pretty(Json(snapshot)));
     for (const auto& [kind, address] : snapshot) {
         if (kind != kWifi && kind != kEthernet) continue;
         addSocket(kind, interfaceOf(kind, wifiName, ethernetName));
@@ -127,9 +128,9 @@ void KesuAdapterManager::check() {
     }
 
     // 2. The current snapshot and the interface names of this moment.
-    const std::map<std::string, std::string> current = Utils::getNetworkCorrespondAddress();
-    const std::string wifiName = Utils::GetWifiName();
-    const std::string ethernetName = Utils::GetEthernetName();
+    const std::map<std::string, std::string> current = SystemInfo::getNetworkCorrespondAddress();
+    const std::string wifiName = SystemInfo::GetWifiName();
+    const std::string ethernetName = SystemInfo::GetEthernetName();
     const std::map<std::string, std::string> previous = netStatus;
     const bool echoTimedOut =
         devices_.clock().now() - devices_.lastOwnEcho() > Config::current().ssdpSelfEchoTimeout;
@@ -144,7 +145,7 @@ void KesuAdapterManager::check() {
 
         if (known == previous.end()) {
             statusLine(current);
-            Utils::mPrintlog("[checkNetWorkStatus] adapter add \n");
+            Log::mPrintlog("[checkNetWorkStatus] adapter add \n");
             publish(ServiceEvent::NetworkChange);
             addSocket(kind, name);
             logInterface(kind, name);
@@ -158,7 +159,7 @@ void KesuAdapterManager::check() {
             if (echoTimedOut) {
                 timedOut = true;
                 statusLine(current);
-                Utils::mPrintlog(
+                Log::mPrintlog(
                     "[checkNetWorkStatus] timeout 60s haven't found myself, ssdp socket maybe block, reinit socket "
                     "here \n");
                 rebuildSocket(kind, name);
@@ -168,7 +169,7 @@ void KesuAdapterManager::check() {
                 const auto socketName = socketInterface_.find(kind);
                 if (socketName != socketInterface_.end() && !socketName->second.empty() &&
                     socketName->second != name) {
-                    Utils::mPrintlog("[checkNetWorkStatus] adapter " + kind + " moved from " + socketName->second +
+                    Log::mPrintlog("[checkNetWorkStatus] adapter " + kind + " moved from " + socketName->second +
                                      " to " + name + " \n");
                     rebuildSocket(kind, name);
                 }
@@ -177,7 +178,7 @@ void KesuAdapterManager::check() {
         }
 
         statusLine(current);
-        Utils::mPrintlog("[checkNetWorkStatus] ip is change \n");
+        Log::mPrintlog("[checkNetWorkStatus] ip is change \n");
         publish(ServiceEvent::NetworkChange);
         rebuildSocket(kind, name);
         const std::string& oldAddress = known->second;
@@ -201,14 +202,14 @@ void KesuAdapterManager::check() {
         if (current.contains(kind)) continue;
         publish(ServiceEvent::NetworkChange);
         statusLine(current);
-        Utils::mPrintlog("[checkNetWorkStatus] adapter remove \n");
+        Log::mPrintlog("[checkNetWorkStatus] adapter remove \n");
         if (kind == kWifi) {
             const std::string name = removeSocket(kind, wifiName);
-            Utils::mPrintlog("[checkNetWorkStatus] wifiName is " + name + "\n");
+            Log::mPrintlog("[checkNetWorkStatus] wifiName is " + name + "\n");
             publish(ServiceEvent::WlanNetDisconnect);
         } else if (kind == kEthernet) {
             const std::string name = removeSocket(kind, ethernetName);
-            Utils::mPrintlog("[checkNetWorkStatus] ethernetName is " + name + " \n");
+            Log::mPrintlog("[checkNetWorkStatus] ethernetName is " + name + " \n");
             publish(ServiceEvent::WiredNetDisconnect);
         }
     }
@@ -218,8 +219,8 @@ void KesuAdapterManager::check() {
 }
 
 void KesuAdapterManager::announce() {
-    const std::string deviceName = Utils::getLocalName();
-    const std::string deviceId = Utils::getMacAddress();
+    const std::string deviceName = SystemInfo::getLocalName();
+    const std::string deviceId = SystemInfo::getMacAddress();
     const std::string openId = dataInstance().get(&databaseParam::openid);
     const std::string account = dataInstance().get(&databaseParam::Phone);
     const std::string serviceId = SsdpMessage::pcServiceRecord();
@@ -227,7 +228,7 @@ void KesuAdapterManager::announce() {
 }
 
 void KesuAdapterManager::announceOn(SsdpSocketManager& manager) {
-    manager.sendResponseData(Utils::getLocalName(), Utils::getMacAddress(), dataInstance().get(&databaseParam::Phone),
+    manager.sendResponseData(SystemInfo::getLocalName(), SystemInfo::getMacAddress(), dataInstance().get(&databaseParam::Phone),
                              dataInstance().get(&databaseParam::openid), SsdpMessage::pcServiceRecord());
 }
 
@@ -312,14 +313,14 @@ void KesuAdapterManager::dropManager(const std::string& interfaceName) {
 
 void KesuAdapterManager::logInterface(const std::string& kind, const std::string& interfaceName) {
     if (kind == kWifi) {
-        Utils::mPrintlog("[checkNetWorkStatus] wifiName is " + interfaceName + " \n");
+        Log::mPrintlog("[checkNetWorkStatus] wifiName is " + interfaceName + " \n");
     } else {
-        Utils::mPrintlog("[checkNetWorkStatus] ethernetName is " + interfaceName + " \n");
+        Log::mPrintlog("[checkNetWorkStatus] ethernetName is " + interfaceName + " \n");
     }
 }
 
 void KesuAdapterManager::statusLine(const std::map<std::string, std::string>& snapshot) {
-    Utils::mPrintlog("[checkNetWorkStatus] Currently netcard status: " + json::compact(Json(snapshot)));
+    Log::mPrintlog("[checkNetWorkStatus] Currently netcard status: " + json::compact(Json(snapshot)));
 }
 
 }  // namespace kesu

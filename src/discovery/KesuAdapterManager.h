@@ -32,7 +32,7 @@ public:
     KesuAdapterManager& operator=(const KesuAdapterManager&) = delete;
 
     // Snapshot, the own-announcement wait restarted, one socket per present adapter.
-    void creatAdapterSocket();
+    void createAdapterSocket();
     // Power state of the Wi-Fi adapter; false when there is none.
     bool isWiFiEnabled();
     // One adapter check: Wi-Fi power events, adapters added, removed or readdressed (with
@@ -44,9 +44,9 @@ public:
     void sendSsdp();
 
     // Closes every socket, drops pending rebuilds and forgets the adapters and the Wi-Fi
-    // state, as before creatAdapterSocket (orderly stop).
+    // state, as before createAdapterSocket (orderly stop).
     void shutdown();
-    // Whether creatAdapterSocket ran since the last shutdown.
+    // Whether createAdapterSocket ran since the last shutdown.
     bool isActive();
 
     // ---- State, for the service's own checks and tests -----------------------------------

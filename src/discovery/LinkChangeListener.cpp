@@ -16,7 +16,7 @@
 #include <vector>
 
 #include "core/EventLoop.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -61,7 +61,7 @@ struct LinkChangeListener::State : std::enable_shared_from_this<State> {
     void onReadable(const asio::error_code& error) {
         if (stopped.load() || error == asio::error::operation_aborted) return;
         if (error) {
-            Utils::mPrintlog("[LinkChangeListener] wait failed: " + error.message() + ", listening stops");
+            Log::mPrintlog("[LinkChangeListener] wait failed: " + error.message() + ", listening stops");
             return;
         }
         bool changed = false;
@@ -74,7 +74,7 @@ struct LinkChangeListener::State : std::enable_shared_from_this<State> {
                     changed = true;
                     continue;
                 }
-                Utils::mPrintlog("[LinkChangeListener] receive failed: " + std::system_category().message(errno) +
+                Log::mPrintlog("[LinkChangeListener] receive failed: " + std::system_category().message(errno) +
                                  ", listening stops");
                 return;
             }
@@ -93,7 +93,7 @@ struct LinkChangeListener::State : std::enable_shared_from_this<State> {
                 try {
                     self->onChange();
                 } catch (const std::exception& ex) {
-                    Utils::mPrintlog(std::string("[LinkChangeListener] change handling failed: ") + ex.what());
+                    Log::mPrintlog(std::string("[LinkChangeListener] change handling failed: ") + ex.what());
                 }
             });
         }
@@ -124,7 +124,7 @@ LinkChangeListener::LinkChangeListener(EventLoop& loop, std::function<void()> on
     local.nl_family = AF_NETLINK;
     local.nl_groups = RTMGRP_LINK | RTMGRP_IPV4_IFADDR;
     if (fd < 0 || ::bind(fd, reinterpret_cast<sockaddr*>(&local), sizeof local) != 0) {
-        Utils::mPrintlog("[LinkChangeListener] network change notifications unavailable: " +
+        Log::mPrintlog("[LinkChangeListener] network change notifications unavailable: " +
                          std::system_category().message(errno));
         if (fd >= 0) ::close(fd);
         state_->stopped.store(true);

@@ -6,7 +6,7 @@
 #include "core/Config.h"
 #include "core/EventLoop.h"
 #include "core/PeriodicTimer.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 #include "discovery/KesuAdapterManager.h"
 #include "discovery/LinkChangeListener.h"
 #include "discovery/SsdpDeviceManager.h"
@@ -66,7 +66,7 @@ void ServiceWorker::pass() {
         adapters_->sendSsdp();
     } catch (const std::exception& e) {
         // One failed pass must not end discovery.
-        Utils::mPrintlog(std::string("[ServiceWorker::ssdpInit] pass failed: ") + e.what());
+        Log::mPrintlog(std::string("[ServiceWorker::ssdpInit] pass failed: ") + e.what());
     }
 }
 

@@ -1,6 +1,6 @@
 #include "discovery/SsdpDeviceManager.h"
 
-#include "core/Utils.h"
+
 
 namespace kesu {
 

@@ -6,7 +6,10 @@
 #include "connect/ConnectCodes.h"
 #include "core/Config.h"
 #include "core/Text.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "core/Text.h"
+#include "core/WallClock.h"
+#include "platform/SystemInfo.h"
 #include "discovery/Base64.h"
 #include "discovery/SsdpDeviceManager.h"
 
@@ -59,7 +62,7 @@ std::string SsdpMessage::responseMessage(const std::string& deviceName, const st
                                          const std::string& account, const std::string& openId,
                                          const std::string& serviceId) {
     const std::string body = json::compact(pcAnnouncement(deviceName, deviceId, account, openId, serviceId));
-    return "RESPONSE * HTTP/1.1\r\nDATE:" + Utils::getNowTime() + "\r\ncompatGsonStr:" + base64::encode(body) +
+    return "RESPONSE * HTTP/1.1\r\nDATE:" + WallClock::getNowTime() + "\r\ncompatGsonStr:" + base64::encode(body) +
            "\r\n";
 }
 
@@ -84,11 +87,11 @@ SsdpMessage::Handling SsdpMessage::handleDatagram(std::string_view data, const s
 SsdpMessage::Handling SsdpMessage::handleDatagram(std::string_view data, const std::string& host,
                                                   SsdpDeviceManager& manager) {
     if (data.empty()) {
-        Utils::mPrintlog("[ssdpSocket::udpSocket] data is nil ...\n");
+        Log::mPrintlog("[ssdpSocket::udpSocket] data is nil ...\n");
         return Handling::dropped;
     }
     if (host.empty()) {
-        Utils::mPrintlog("[ssdpSocket::udpSocket] host is nil ...\n");
+        Log::mPrintlog("[ssdpSocket::udpSocket] host is nil ...\n");
         return Handling::dropped;
     }
     // Anyone on the LAN can send anything: a text that is not UTF-8 is dropped silently.
@@ -105,12 +108,12 @@ SsdpMessage::Handling SsdpMessage::handleDatagram(std::string_view data, const s
     const std::string decoded = decodeCompatPayload(data);
     if (decoded.empty()) return Handling::dropped;
     if (!text::isValidUtf8(decoded)) {
-        Utils::mPrintlog("[ssdpSocket::udpSocket] recvDecodeNSString is nil ...\n");
+        Log::mPrintlog("[ssdpSocket::udpSocket] recvDecodeNSString is nil ...\n");
         return Handling::dropped;
     }
     // An announcement that names this PC (normally its own, looped back) shows that the
     // sockets still hear the group. An empty name would match everything: it matches nothing.
-    const std::string localName = Utils::getLocalName();
+    const std::string localName = SystemInfo::getLocalName();
     if (!localName.empty() && contains(decoded, localName)) {
         manager.markOwnEcho();
     }
@@ -205,13 +208,13 @@ void SsdpMessage::insertResponseDevice(const std::string& recvData, const std::s
     auto device = std::make_shared<SsdpDevice>();
     const bool parsed = newDataFlag ? parserResponseData(recvData, *device) : parserOldResponseData(recvData, *device);
     if (!parsed) {
-        Utils::mPrintlog("[ssdpSocket::insertResponseDevice] receive data is empty or parser fail ...\n");
+        Log::mPrintlog("[ssdpSocket::insertResponseDevice] receive data is empty or parser fail ...\n");
     }
     device->isOpenIdSame = !device->openId.empty() && !openId.empty() && device->openId == openId;
     device->ip.push_back(ip);
     if (device->ip.empty() || device->deviceId.empty()) return;
 
-    device->lastUpdate = Utils::currentTimeStamp();
+    device->lastUpdate = WallClock::currentTimeStamp();
     // The observers compare the new record with the stored one: before the table changes.
     manager.notifyChange(*device);
 
@@ -223,7 +226,7 @@ void SsdpMessage::insertResponseDevice(const std::string& recvData, const std::s
         return;
     }
     manager.ssdpDeviceMap.insert(key, device);
-    Utils::mPrintlog("[ssdpSocket::insertResponseDevice] Insert ssdp device, deviceId: " + device->deviceId +
+    Log::mPrintlog("[ssdpSocket::insertResponseDevice] Insert ssdp device, deviceId: " + device->deviceId +
                      "  account: " + device->account + "  openId: " + device->openId +
                      "  deviceName: " + device->deviceName + "  guide: " + device->guide +
                      "  isOpenIdSame: " + (device->isOpenIdSame ? "true" : "false") + "\n");
@@ -233,14 +236,14 @@ void SsdpMessage::insertResponseDevice(const std::string& recvData, const std::s
 
 std::string SsdpMessage::maskValue(const std::string& value, bool& full) {
     full = text::graphemeCount(value) < 7;
-    return full ? value : Utils::paramAddMask(value);
+    return full ? value : text::paramAddMask(value);
 }
 
 std::string SsdpMessage::deviceIdentifier(const std::string& announcedId) {
     const auto chars = text::graphemes(announcedId);
     std::string head;
     for (std::size_t i = 0; i < chars.size() && i < 4; ++i) head.append(chars[i]);
-    return Utils::uintToHexString(head);
+    return text::uintToHexString(head);
 }
 
 }  // namespace kesu

@@ -3,7 +3,7 @@
 #include <chrono>
 
 #include "core/Config.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -59,7 +59,7 @@ bool SsdpSafemap::insert(const std::string& opKey, SsdpDevicePtr opValue, bool c
         storeLocked(opKey, std::move(opValue));
     }
     if (logEviction) {
-        Utils::mPrintlog("[SsdpSafemap::insert] device table full (" + std::to_string(maxDevices_) +
+        Log::mPrintlog("[SsdpSafemap::insert] device table full (" + std::to_string(maxDevices_) +
                          " devices), evicting the oldest entries, first: " + evictedKey + "\n");
     }
     return true;
@@ -103,7 +103,7 @@ bool SsdpSafemap::eraseTimeOut() {
         if (safeMap.size() < maxDevices_) evictionLogged_ = false;
     }
     for (const auto& device : erased) {
-        Utils::mPrintlog("[eraseTimeOut]: erase ssdpdevice: " + device->deviceName + ", " + device->deviceId + "\r\n");
+        Log::mPrintlog("[eraseTimeOut]: erase ssdpdevice: " + device->deviceName + ", " + device->deviceId + "\r\n");
     }
     return !erased.empty();
 }

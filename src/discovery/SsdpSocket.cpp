@@ -15,7 +15,7 @@
 #include "core/Config.h"
 #include "core/EventLoop.h"
 #include "core/Text.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 #include "discovery/SsdpMessage.h"
 
 namespace kesu {
@@ -47,16 +47,16 @@ struct SsdpSocket::State : std::enable_shared_from_this<State> {
     void onReceive(const asio::error_code& error, std::size_t bytes) {
         if (closed.load() || error == asio::error::operation_aborted || error == asio::error::bad_descriptor) return;
         if (error) {
-            Utils::mPrintlog("[SsdpSocket::udpSocket] receive failed: " + error.message());
+            Log::mPrintlog("[SsdpSocket::udpSocket] receive failed: " + error.message());
             if (++receiveErrors >= kMaxReceiveErrors) {
-                Utils::mPrintlog("[SsdpSocket::udpSocket] too many receive failures, receiving stops on " + netCard);
+                Log::mPrintlog("[SsdpSocket::udpSocket] too many receive failures, receiving stops on " + netCard);
                 receiving.store(false);
                 return;
             }
         } else {
             receiveErrors = 0;
             if (bytes > buffer.size()) {
-                Utils::mPrintlog("[SsdpSocket::udpSocket] datagram of " + std::to_string(bytes) +
+                Log::mPrintlog("[SsdpSocket::udpSocket] datagram of " + std::to_string(bytes) +
                                  " bytes is longer than " + std::to_string(buffer.size()) + ", dropped");
             } else {
                 // 0.0.0.0 as sender comes only from this machine (a loopback interface without
@@ -65,7 +65,7 @@ struct SsdpSocket::State : std::enable_shared_from_this<State> {
                 try {
                     receiver(std::string_view(buffer.data(), bytes), host, sender.port());
                 } catch (const std::exception& e) {
-                    Utils::mPrintlog(std::string("[SsdpSocket::udpSocket] datagram handling failed: ") + e.what());
+                    Log::mPrintlog(std::string("[SsdpSocket::udpSocket] datagram handling failed: ") + e.what());
                 }
             }
         }
@@ -154,7 +154,7 @@ SsdpSocket::SsdpSocket(EventLoop& loop, std::string inNetCard, Receiver receiver
             0) {
             s.boundToDevice.store(true);
         } else {
-            Utils::mPrintlog("[SsdpSocket::initSocket] bind to device " + netCard +
+            Log::mPrintlog("[SsdpSocket::initSocket] bind to device " + netCard +
                              " failed: " + lastSystemError().message());
         }
     }
@@ -164,7 +164,7 @@ SsdpSocket::SsdpSocket(EventLoop& loop, std::string inNetCard, Receiver receiver
     if (!ec) {
         asio::error_code ignored;
         s.localPort.store(s.socket.local_endpoint(ignored).port());
-        Utils::mPrintlog("[SsdpSocket::initSocket] bind success");
+        Log::mPrintlog("[SsdpSocket::initSocket] bind success");
     }
 
     // 4. Broadcast.
@@ -184,25 +184,25 @@ SsdpSocket::SsdpSocket(EventLoop& loop, std::string inNetCard, Receiver receiver
 
     // 6. Continuous receiving, on the loop.
     if (ec) {
-        Utils::mPrintlog("[SsdpSocket::initSocket] Error occur as:" + ec.message());
+        Log::mPrintlog("[SsdpSocket::initSocket] Error occur as:" + ec.message());
     } else {
         s.receiving.store(true);
         asio::post(loop.context(), [state = state_] {
             if (!state->closed.load()) state->receive();
         });
-        Utils::mPrintlog("[SsdpSocket::initSocket] beginReceiving success");
+        Log::mPrintlog("[SsdpSocket::initSocket] beginReceiving success");
     }
     s.started.store(s.socket.is_open());
 }
 
 SsdpSocket::~SsdpSocket() {
-    Utils::mPrintlog("[SsdpSocket::deinit] close and delete a ssdp socket");
+    Log::mPrintlog("[SsdpSocket::deinit] close and delete a ssdp socket");
     close();
 }
 
 bool SsdpSocket::sendMsg(const std::string& message) {
     if (!text::isValidUtf8(message)) {
-        Utils::mPrintlog("[SsdpSocket::senMsg]data format error");
+        Log::mPrintlog("[SsdpSocket::senMsg]data format error");
         return false;
     }
     return queueSend(std::make_shared<const std::string>(message));
@@ -222,7 +222,7 @@ bool SsdpSocket::queueSend(std::shared_ptr<const std::string> data) {
 }
 
 bool SsdpSocket::initial(std::uint16_t /*port*/, const std::string& ip, int /*timeout*/) {
-    Utils::mPrintlog("[SsdpSocket::initial] a discovery socket sends to the group only, not to " + ip);
+    Log::mPrintlog("[SsdpSocket::initial] a discovery socket sends to the group only, not to " + ip);
     return false;
 }
 

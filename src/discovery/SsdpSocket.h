@@ -49,7 +49,7 @@ public:
     bool close() override;
     // True when no open socket is left (closed, or the first set-up step failed).
     bool isSocketNull() override;
-    std::string getSokcetType() override { return "udp"; }
+    std::string getSocketType() override { return "udp"; }
 
     // The interface the socket was made for (joins the group there, sends from there).
     const std::string netCard;

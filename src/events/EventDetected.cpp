@@ -2,7 +2,7 @@
 
 #include "core/Config.h"
 #include "core/EventLoop.h"
-#include "core/Utils.h"
+#include "platform/SystemInfo.h"
 #include "events/EventPublisher.h"
 
 namespace kesu {
@@ -21,7 +21,7 @@ EventDetected::EventDetected(EventLoop& loop)
              [&loop, state = state_] {
                  if (state->checking) return;  // the previous check still runs
                  state->checking = true;
-                 loop.offload([] { return Utils::isScreenUnlocked(); }, [state](bool unlocked) {
+                 loop.offload([] { return SystemInfo::isScreenUnlocked(); }, [state](bool unlocked) {
                      state->checking = false;
                      if (state->stopped || unlocked == state->unlocked) return;
                      state->unlocked = unlocked;

@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -18,7 +18,7 @@ void EventPublisher::addObserver(std::shared_ptr<IEventSubscriber> observer) {
 }
 
 void EventPublisher::notifySubscribers(ServiceEvent event) {
-    Utils::mPrintlog(std::string("[EventPublisher::notifySubscribers] notifySubscribers event is: ") +
+    Log::mPrintlog(std::string("[EventPublisher::notifySubscribers] notifySubscribers event is: ") +
                      eventName(event));
     for (const auto& observer : observers()) observer->notify(event);
 }

@@ -5,7 +5,7 @@
 #include <string>
 
 #include "core/EventLoop.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -46,7 +46,7 @@ void IEventSubscriber::runNext() {
     try {
         eventNotify(event);
     } catch (const std::exception& e) {
-        Utils::mPrintlog(std::string("[IEventSubscriber] handling ") + eventName(event) + " failed: " + e.what());
+        Log::mPrintlog(std::string("[IEventSubscriber] handling ") + eventName(event) + " failed: " + e.what());
     }
     {
         std::lock_guard<std::mutex> lock(mutex_);

@@ -1,7 +1,9 @@
 #include "events/SystemEventSubscriber.h"
 
 #include "core/Json.h"
-#include "core/Utils.h"
+#include "core/Endpoints.h"
+#include "core/Log.h"
+#include "pcsuite/PcsuiteClient.h"
 
 namespace kesu {
 
@@ -22,15 +24,15 @@ void SystemEventSubscriber::systemEventNotifyHandle(ServiceEvent event) {
     else if (event == ServiceEvent::LogOut) body = {{"event", "LogOn"}, {"status", 0}};
     else if (event == ServiceEvent::WifiOpen) body = {{"event", "wifi"}, {"status", 1}};
     std::string response;
-    Utils::httpMsgSend(json::compact(body), Utils::pcsuiteHttpServerNotifySystemEventUrl(), "POST", response);
+    PcsuiteClient::httpMsgSend(json::compact(body), Endpoints::pcsuiteHttpServerNotifySystemEventUrl(), "POST", response);
 }
 
 void SystemEventSubscriber::networkChangeDuringConnectionHandle(ServiceEvent event) {
     if (!handles(event)) return;
     std::string deviceType, status;
-    if (Utils::isDeviceConnectable("phone", deviceType, status) &&
-        Utils::isDeviceConnectable("pad", deviceType, status)) {
-        Utils::mPrintlog("[networkChangeDuringConnectionHandle] Current pc haven't connected device \n");
+    if (PcsuiteClient::isDeviceConnectable("phone", deviceType, status) &&
+        PcsuiteClient::isDeviceConnectable("pad", deviceType, status)) {
+        Log::mPrintlog("[networkChangeDuringConnectionHandle] Current pc haven't connected device \n");
         return;
     }
     int netType = 0, state = 0;
@@ -41,9 +43,9 @@ void SystemEventSubscriber::networkChangeDuringConnectionHandle(ServiceEvent eve
     else return;
     const Json record = {{"type", 1}, {"eventId", "W688|10308"}, {"params", {{"net_type", netType}, {"state", state}}}};
     const std::string buryPointStr = "[" + json::pretty(record) + "]";
-    Utils::mPrintlog("[networkChangeDuringConnectionHandle] sendBuryPoint buryPointStr is: " + buryPointStr + " \n");
-    if (Utils::sendBuryPoint(buryPointStr))
-        Utils::mPrintlog("[networkChangeDuringConnectionHandle] sendBuryPoint success \n");
+    Log::mPrintlog("[networkChangeDuringConnectionHandle] sendBuryPoint buryPointStr is: " + buryPointStr + " \n");
+    if (PcsuiteClient::sendBuryPoint(buryPointStr))
+        Log::mPrintlog("[networkChangeDuringConnectionHandle] sendBuryPoint success \n");
 }
 
 }  // namespace kesu

@@ -1,11 +1,12 @@
 // Telemetry records ("bury points") in the list shape that is posted to the PC suite
-// (Utils::sendBuryPoint).
+// (PcsuiteClient::sendBuryPoint).
 #pragma once
 
 #include <nlohmann/json.hpp>
 #include <string>
 
 #include "core/Json.h"
+#include "pcsuite/PcsuiteClient.h"
 
 namespace kesu {
 

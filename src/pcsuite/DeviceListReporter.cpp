@@ -12,7 +12,10 @@
 
 #include "core/Config.h"
 #include "core/Json.h"
-#include "core/Utils.h"
+#include "core/Endpoints.h"
+#include "core/Log.h"
+#include "pcsuite/PcsuiteClient.h"
+#include "platform/SystemInfo.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "pcsuite/RequestBase.h"
 #include "preconnect/DeviceWaitForPreConnectManager.h"
@@ -135,11 +138,11 @@ void DeviceListReporter::notify() {
 
 bool DeviceListReporter::send(const std::string& url) {
     if (!mayReport()) return false;
-    if (!Utils::isAppRunning(pcsuiteAppName)) return false;
+    if (!SystemInfo::isAppRunning(pcsuiteAppName)) return false;
 
     const std::string body = buildBody();
     std::string response;
-    const bool posted = Utils::httpMsgSend(body, url, "POST", response);
+    const bool posted = PcsuiteClient::httpMsgSend(body, url, "POST", response);
     afterPost(body);
     return posted;
 }
@@ -172,12 +175,12 @@ WlanReportDevices::WlanReportDevices(SsdpDeviceManager& manager)
 // Stopped here, while the whole object still exists: a send under way calls the overrides.
 WlanReportDevices::~WlanReportDevices() { stop(); }
 
-std::string WlanReportDevices::reportUrl() const { return Utils::pcsuiteHttpServerSSDPQuerryAllUrl(); }
+std::string WlanReportDevices::reportUrl() const { return Endpoints::pcsuiteHttpServerSSDPQueryAllUrl(); }
 
 bool WlanReportDevices::mayReport() {
-    const auto snapshot = Utils::getNetworkCorrespondAddress();
-    if (snapshot.find("Ethernet") == snapshot.end() && !Utils::SsidWifiCondition()) {
-        Utils::mPrintlog("[WlanReportDevices::sendDevices] Network is useless, don't send wlan devices");
+    const auto snapshot = SystemInfo::getNetworkCorrespondAddress();
+    if (snapshot.find("Ethernet") == snapshot.end() && !SystemInfo::SsidWifiCondition()) {
+        Log::mPrintlog("[WlanReportDevices::sendDevices] Network is useless, don't send wlan devices");
         return false;
     }
     return true;
@@ -201,7 +204,7 @@ ReportDevicesV2::ReportDevicesV2(DeviceWaitForPreConnectManager& registry)
 
 ReportDevicesV2::~ReportDevicesV2() { stop(); }
 
-std::string ReportDevicesV2::reportUrl() const { return Utils::pcsuiteHttpServerPushGattClientListUrl(); }
+std::string ReportDevicesV2::reportUrl() const { return Endpoints::pcsuiteHttpServerPushGattClientListUrl(); }
 
 std::string ReportDevicesV2::buildBody() {
     return listText(registry_.getAllDevices(),
@@ -209,7 +212,7 @@ std::string ReportDevicesV2::buildBody() {
 }
 
 void ReportDevicesV2::afterPost(const std::string& body) {
-    Utils::mPrintlog("[ReportDevicesV2::sendDevices] [INTERACTION][CONNSERVER_TO_PCSUITE] SendDevices content: " +
+    Log::mPrintlog("[ReportDevicesV2::sendDevices] [INTERACTION][CONNSERVER_TO_PCSUITE] SendDevices content: " +
                      RequestBase::maskForLog(body));
 }
 

@@ -1,6 +1,7 @@
 #include "pcsuite/PcsuiteRequest.h"
 
-#include "core/Utils.h"
+#include "core/Endpoints.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -21,7 +22,7 @@ std::optional<Json> PcsuiteRequest::requestIntercept(const std::string& path, co
     if (body) bodyText = json::compact(*body);
     int status = 0;
     std::string msg;
-    const Json answer = RequestBase::http(Utils::pcsuiteHttpServerUrl(), path, bodyText, method,
+    const Json answer = RequestBase::http(Endpoints::pcsuiteHttpServerUrl(), path, bodyText, method,
                                           header.value_or(RequestBase::Headers{}), status, msg);
     return responseIntercept(answer, path);
 }
@@ -31,11 +32,11 @@ std::optional<Json> PcsuiteRequest::responseIntercept(const Json& answer, const 
     // Only the six-character text counts: a numeric 0 is some other server's idea of success.
     if (answer.is_object() && !answer.empty() && answer.contains("code") && answer["code"].is_string() &&
         answer["code"].get<std::string>() == rawValue(PcsuiteResCode::Success)) {
-        Utils::mPrintlog("[PcsuiteRequest][responseIntercept] [INTERACTION][PCSUITE_TO_CONNSERVER] path: " + path +
+        Log::mPrintlog("[PcsuiteRequest][responseIntercept] [INTERACTION][PCSUITE_TO_CONNSERVER] path: " + path +
                          ", response: " + answerText + " \n");
         return answer;
     }
-    Utils::mPrintlog("[PcsuiteRequest][responseIntercept] path: " + path + " request err: " + answerText + " \n");
+    Log::mPrintlog("[PcsuiteRequest][responseIntercept] path: " + path + " request err: " + answerText + " \n");
     return std::nullopt;
 }
 

@@ -9,7 +9,8 @@
 
 #include "core/Config.h"
 #include "core/Text.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "core/Text.h"
 
 namespace kesu {
 
@@ -72,7 +73,7 @@ bool maskCredentials(Json& j) {
     if (j.is_object()) {
         for (auto it = j.begin(); it != j.end(); ++it) {
             if (isCredentialName(it.key()) && it->is_string()) {
-                *it = Utils::paramAddMask(it->get<std::string>());
+                *it = text::paramAddMask(it->get<std::string>());
                 masked = true;
             } else if (isCredentialName(it.key()) && !it->is_null() && !it->is_object() && !it->is_array()) {
                 *it = "****";
@@ -162,7 +163,7 @@ RequestBase::Answer RequestBase::exchange(const std::string& url, const std::str
 
 Json RequestBase::http(const std::string& baseUrl, const std::string& path, const std::optional<std::string>& body,
                        MethodType method, const Headers& requestHeader, int& status, std::string& msg) {
-    Utils::mPrintlog("[RequestBase][http] path: " + path);
+    Log::mPrintlog("[RequestBase][http] path: " + path);
     const std::string url = baseUrl + path;
 
     Headers headers{{"Content-Type", rawValue(ContentType::json)}};
@@ -180,14 +181,14 @@ Json RequestBase::http(const std::string& baseUrl, const std::string& path, cons
     for (int attempt = 1; attempt <= kMaxAttempts; ++attempt) {
         answer = exchange(url, rawValue(method), body.value_or(std::string()), headers, timeout);
         if (!answer.responded) {
-            Utils::mPrintlog("[RequestBase][http] Invalid response, path: " + path + " error is: " + answer.error);
+            Log::mPrintlog("[RequestBase][http] Invalid response, path: " + path + " error is: " + answer.error);
             break;
         }
         answerText = text::isValidUtf8(answer.body) ? answer.body : std::string();
-        Utils::mPrintlog("[RequestBase][http] http client have respond data! " + path +
+        Log::mPrintlog("[RequestBase][http] http client have respond data! " + path +
                          " data: " + maskForLog(answerText) + "\n");
         if (answer.status != static_cast<int>(StatusCode::TOOMANYREQUESTS)) break;
-        Utils::mPrintlog("[RequestBase][http] http request status code is 429, request again, request num: " +
+        Log::mPrintlog("[RequestBase][http] http request status code is 429, request again, request num: " +
                          std::to_string(attempt) + "\n");
         if (attempt == kMaxAttempts) break;
         std::this_thread::sleep_for(pause);
@@ -202,7 +203,7 @@ Json RequestBase::http(const std::string& baseUrl, const std::string& path, cons
         }
         if (!answerText.empty()) msg = answerText;
     }
-    Utils::mPrintlog("[RequestBase][http] " + url + " timeout 20s \n");
+    Log::mPrintlog("[RequestBase][http] " + url + " timeout 20s \n");
     return Json{{"error", "timeout"}};
 }
 
@@ -220,10 +221,10 @@ bool RequestBase::urlSessionPost(const std::string& jPara, const std::string& jI
     const Answer answer = exchange(jIphttp, rawValue(MethodType::post), jPara,
                                    {{"Content-Type", rawValue(ContentType::form)}}, Config::current().httpWaitTimeout);
     if (answer.responded) {
-        Utils::mPrintlog("[Notify Pcsuite] Notify Server to accept mirroscreen data success\n");
+        Log::mPrintlog("[Notify Pcsuite] Notify Server to accept mirroscreen data success\n");
         return true;
     }
-    Utils::mPrintlog("[Notify Pcsuite] Notify Server to accept mirroscreen data but no response return\n");
+    Log::mPrintlog("[Notify Pcsuite] Notify Server to accept mirroscreen data but no response return\n");
     return false;
 }
 

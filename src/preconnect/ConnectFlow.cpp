@@ -2,7 +2,7 @@
 
 #include "connect/ConnectCodes.h"
 #include "connect/Step.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 #include "discovery/StateCheck.h"
 #include "preconnect/DeviceWaitForPreConnectManager.h"
 
@@ -16,22 +16,22 @@ std::string ConnectFlow::buildResult(int error, const std::string& errorMsg, con
 
 bool ConnectFlow::findPreconnectDevice(const std::string& id, std::string& connectSteps) {
     const Step& step = sharedStep();
-    Utils::mPrintlog("[ConnectFlow::findPreconnectDevice] Find preconnect device by deviceId: " + id);
+    Log::mPrintlog("[ConnectFlow::findPreconnectDevice] Find preconnect device by deviceId: " + id);
     DeviceWaitForPreConnectManager::Entry device;
     const bool found = DeviceWaitForPreConnectManager::instance().lookupDevices(id, device);
     connectSteps += step.getConnectCode(step.OS4_WLAN_FIND_DEVICES);
     if (!found) {
-        Utils::mPrintlog("[ConnectFlow::findPreconnectDevice] Preconnect device not find!");
+        Log::mPrintlog("[ConnectFlow::findPreconnectDevice] Preconnect device not find!");
         connectSteps += step.getConnectResult(step.OS4_WLAN_FIND_DEVICES, Result::FAILED);
         return false;
     }
     if (!device->getIsConnected()) {
-        Utils::mPrintlog("[ConnectFlow::findPreconnectDevice] device is not preconnect!");
+        Log::mPrintlog("[ConnectFlow::findPreconnectDevice] device is not preconnect!");
         connectSteps += step.getConnectResult(step.OS4_WLAN_FIND_DEVICES, Result::FAILED);
         return false;
     }
     connectSteps += step.getConnectResult(step.OS4_WLAN_FIND_DEVICES, Result::OK);
-    Utils::mPrintlog("[ConnectFlow::findPreconnectDevice] preconnect device find, deviceId is: " +
+    Log::mPrintlog("[ConnectFlow::findPreconnectDevice] preconnect device find, deviceId is: " +
                      device->getDeviceId());
     return true;
 }
@@ -40,11 +40,11 @@ std::string ConnectFlow::start(const std::string& id, std::string& /*deviceType*
                                const std::string& /*autoConnectType*/) {
     std::string steps;
     StateCheck::instance().setPrimaryConnectCancel(false);
-    Utils::mPrintlog("[ConnectFlow::start] $$[Statistical][connectionspeed][wlan][node0][" + id + "]$$");
+    Log::mPrintlog("[ConnectFlow::start] $$[Statistical][connectionspeed][wlan][node0][" + id + "]$$");
     if (!findPreconnectDevice(id, steps))
         return buildResult(rawValue(ErrorCode::NOT_FOUND), "Preconnect device not find", steps);
     // A held link exists only once pre-connection runs; until then no entry is connected.
-    return buildResult(rawValue(ErrorCode::UNKNOW), "Preconnect type is unkonw", steps);
+    return buildResult(rawValue(ErrorCode::UNKNOWN), "Preconnect type is unkonw", steps);
 }
 
 }  // namespace kesu

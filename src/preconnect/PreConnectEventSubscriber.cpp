@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "core/Utils.h"
+#include "core/Log.h"
 
 namespace kesu {
 
@@ -12,7 +12,7 @@ PreConnectEventSubscriber::PreConnectEventSubscriber(EventLoop& loop)
                               ServiceEvent::DeviceListUpdate, ServiceEvent::DeviceInfoReport}) {}
 
 void PreConnectEventSubscriber::eventNotify(ServiceEvent event) {
-    Utils::mPrintlog(std::string("[PreConnectEventSubscriber::eventNotify] preconnect eventNotify ") +
+    Log::mPrintlog(std::string("[PreConnectEventSubscriber::eventNotify] preconnect eventNotify ") +
                      eventName(event) + ": pre-connection not built yet, no device to adjust");
 }
 

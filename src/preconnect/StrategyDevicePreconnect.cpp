@@ -1,6 +1,6 @@
 #include "preconnect/StrategyDevicePreconnect.h"
 
-#include "core/Utils.h"
+#include "core/Log.h"
 #include "preconnect/DeviceWaitForPreConnectManager.h"
 
 namespace kesu {
@@ -8,16 +8,16 @@ namespace kesu {
 bool StrategyDevicePreconnect::preconnectDeviceByDeviceId(const std::string& deviceId) {
     DeviceWaitForPreConnectManager::Entry device;
     if (!DeviceWaitForPreConnectManager::instance().lookupDevices(deviceId, device)) {
-        Utils::mPrintlog("[StrategyDevicePreconnect::preconnectDeviceByDeviceId] device not found: " + deviceId);
+        Log::mPrintlog("[StrategyDevicePreconnect::preconnectDeviceByDeviceId] device not found: " + deviceId);
         return false;
     }
     if (device->getIsConnected()) {
-        Utils::mPrintlog(
+        Log::mPrintlog(
             "[StrategyDevicePreconnect::preconnectDeviceByDeviceId] This device is already preconnect success");
         return true;
     }
     // The handshake runs from the scheduler's entries; none can be started from here yet.
-    Utils::mPrintlog("[StrategyDevicePreconnect::preconnectDeviceByDeviceId] no pre-connection for " + deviceId);
+    Log::mPrintlog("[StrategyDevicePreconnect::preconnectDeviceByDeviceId] no pre-connection for " + deviceId);
     return false;
 }
 

@@ -18,7 +18,7 @@ void check(bool condition) {
 }
 
 bool sameRequest(const kesu::requestObj& a, const kesu::requestObj& b) {
-    return a.event == b.event && a.sourec == b.sourec && a.params == b.params;
+    return a.event == b.event && a.source == b.source && a.params == b.params;
 }
 
 }  // namespace

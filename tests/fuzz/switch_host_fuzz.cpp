@@ -5,7 +5,7 @@
 #include <cstdlib>
 #include <string_view>
 
-#include "core/Utils.h"
+#include "core/Endpoints.h"
 
 namespace {
 
@@ -17,7 +17,7 @@ void check(bool condition) {
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
     const std::string_view content(reinterpret_cast<const char*>(data), size);
-    const auto entry = kesu::Utils::parseSwitchHost(content);
+    const auto entry = kesu::Endpoints::parseSwitchHost(content);
     if (!entry) return 0;
     constexpr std::string_view key = "ConnectionCenterHost=";
     check(entry->compare(0, key.size(), key) == 0);

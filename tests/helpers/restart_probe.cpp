@@ -1,7 +1,7 @@
 // Calls the self-restart from a process of its own; exits 3 if the restart returned.
-#include "core/Utils.h"
+#include "core/Process.h"
 
 int main() {
-    kesu::Utils::restartService();
+    kesu::process::restartService();
     return 3;
 }

@@ -1,5 +1,9 @@
 #include "support/TestSupport.h"
 
+#include "connect/ConnectionState.h"
+#include "core/Endpoints.h"
+#include "platform/SystemInfo.h"
+
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <sys/socket.h>
@@ -55,6 +59,12 @@ HermeticEnv::~HermeticEnv() {
     // A pre-connect list report a test set off must not outlive the Config it was sent under.
     ReportDevicesV2::instance().cancel();
     Config::current() = saved_;
+}
+
+void resetSharedStateForTest() {
+    ConnectionState::resetForTest();
+    SystemInfo::resetForTest();
+    Endpoints::setConnectCenterServerUrl("");
 }
 
 std::string readAll(const std::string& path) {

@@ -59,6 +59,10 @@ private:
 };
 
 // Reads a whole file; empty when missing.
+// The process-wide connection slots, flags and remembered adapters back at their start
+// values, so that one test's connection does not leave the next one busy.
+void resetSharedStateForTest();
+
 std::string readAll(const std::string& path);
 
 // A free TCP port on 127.0.0.1 (bound then released; good enough for tests).

@@ -11,13 +11,14 @@
 
 #include "control/HttpService.h"
 #include "core/Json.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "core/WallClock.h"
 #include "support/TestSupport.h"
 
 namespace kesu::test {
 
 // Everything logged today so far.
-inline std::string todaysLog() { return readAll(Utils::logFilePath(Utils::now())); }
+inline std::string todaysLog() { return readAll(Log::logFilePath(WallClock::now())); }
 
 inline bool logged(const std::string& line) { return todaysLog().find(line) != std::string::npos; }
 

@@ -12,7 +12,7 @@
 #include <cerrno>
 #include <cstring>
 
-#include "core/Utils.h"
+#include "core/WallClock.h"
 #include "discovery/Base64.h"
 
 namespace kesu::phonesim {
@@ -68,7 +68,7 @@ std::string announcement(const Identity& phone, bool oldFormat) {
                            {"port", 10191},
                            {"deviceType", phone.type},
                            {"pcCustomizedData", phone.guide}};
-    return "RESPONSE * HTTP/1.1\r\nDATE:" + Utils::getNowTime() + "\r\ncompatGsonStr:" + base64::encode(j.dump()) +
+    return "RESPONSE * HTTP/1.1\r\nDATE:" + WallClock::getNowTime() + "\r\ncompatGsonStr:" + base64::encode(j.dump()) +
            "\r\n";
 }
 

@@ -9,7 +9,7 @@
 #include <string>
 
 #include "account/DataInstance.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 #include "support/TestSupport.h"
 #include "unit/UnitHelpers.h"
 
@@ -29,7 +29,7 @@ protected:
     }
     void TearDown() override {
         dataInstance().update([](databaseParam& p) { p = databaseParam{}; });
-        Utils::closeLog();
+        Log::closeLog();
     }
 
     std::string supportDir() const { return env.home() + "/Library/Application Support/pcsuite"; }

@@ -10,6 +10,7 @@
 
 #include "support/StubPcSuite.h"
 #include "unit/account/AccountFixture.h"
+#include "core/Log.h"
 
 namespace kesu::test {
 namespace {
@@ -230,7 +231,7 @@ TEST_F(DataGetTest, HistoryFileAndDeviceIdSurviveBadInput) {
     // A numeric id is no id; a missing version falls back to the service's own.
     pcsuite.setAnswer("/pcDeviceInfo", {200, R"({"code": "000000", "data": {"deviceId": 12345}})"});
     EXPECT_EQ(getPcsuiteDeviceInfo(), "file-id");
-    EXPECT_EQ(dataInstance().get().version, Utils::versionCode);
+    EXPECT_EQ(dataInstance().get().version, Log::versionCode);
     // Refused, and config.json has no id: empty.
     pcsuite.setAnswer("/pcDeviceInfo", {200, R"({"code": "000001"})"});
     dataInstance().set(&databaseParam::pcDeviceId, "");

@@ -16,6 +16,7 @@
 #include "support/UdpCatcher.h"
 #include "unit/account/AccountFixture.h"
 #include "unit/events/EventRecorder.h"
+#include "core/Log.h"
 
 namespace kesu::test {
 namespace {
@@ -345,7 +346,7 @@ TEST_F(FileMonitorTest, ServiceStartReadsWithoutWaitingAPeriodAndFillsTheDeviceI
 
     ASSERT_TRUE(fileMonitorStart(loop));
     EXPECT_EQ(dataInstance().get().pcDeviceId, "file-id");
-    EXPECT_EQ(dataInstance().get().version, Utils::versionCode);
+    EXPECT_EQ(dataInstance().get().version, Log::versionCode);
     EXPECT_FALSE(fileMonitorStart(loop));
     ASSERT_TRUE(events->waitFor("AccountChangeEvent", 1));
     EXPECT_EQ(dataInstance().get().openid, "oid-1");

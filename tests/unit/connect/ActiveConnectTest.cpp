@@ -5,11 +5,13 @@
 
 #include <future>
 
-#include "connect/Pcuitinterface.h"
+#include "connect/PcsuiteInterface.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "phonesim/PhoneSimulator.h"
 #include "unit/UnitHelpers.h"
 #include "unit/connect/ConnectFixture.h"
+#include "connect/ConnectionState.h"
+#include "core/WallClock.h"
 
 namespace kesu {
 namespace {
@@ -39,14 +41,14 @@ protected:
     void SetUp() override {
         PcIdentityTest::SetUp();
         loop.start();
-        Pcuitinterface::setLoop(&loop);
+        PcsuiteInterface::setLoop(&loop);
         clearTable();
         env.config().activeConnectTimeout = kLong;
     }
     void TearDown() override {
         clearTable();
         SSDPcancel() = false;
-        Pcuitinterface::setLoop(nullptr);
+        PcsuiteInterface::setLoop(nullptr);
         PcIdentityTest::TearDown();
     }
     static void clearTable() { SsdpDeviceManager::instance().ssdpDeviceMap.clear(); }
@@ -55,7 +57,7 @@ protected:
         device->deviceId = id;
         device->ip = std::move(ip);
         device->deviceType = type;
-        device->lastUpdate = Utils::currentTimeStamp();
+        device->lastUpdate = WallClock::currentTimeStamp();
         SsdpDeviceManager::instance().ssdpDeviceMap.insert(id, device);
     }
     // A phone on loopback known to the table as "d1".
@@ -63,7 +65,7 @@ protected:
         env.config().phoneTcpPort = phone.port();
         addDevice("d1", {"127.0.0.1"}, type);
     }
-    static Json connect(const std::string& id) { return Json::parse(Pcuitinterface().ActiveConnect(id)); }
+    static Json connect(const std::string& id) { return Json::parse(PcsuiteInterface().ActiveConnect(id)); }
 };
 
 TEST_F(ActiveConnectTest, PhoneAgreesWithTheRequestOnTheWire) {
@@ -75,8 +77,8 @@ TEST_F(ActiveConnectTest, PhoneAgreesWithTheRequestOnTheWire) {
                                    {"data", "127.0.0.1"}}));
     EXPECT_EQ(phone.request(5s), pcRequest().dump());  // compact JSON with exactly these members
     EXPECT_TRUE(phone.pcClosed(kWellBeforeLong));      // the link is closed after the answer
-    EXPECT_EQ(Utils::getConnectingDeviceType(), "pad");
-    EXPECT_TRUE(Utils::getWlanConnState());
+    EXPECT_EQ(ConnectionState::getConnectingDeviceType(), "pad");
+    EXPECT_TRUE(ConnectionState::getWlanConnState());
 }
 
 TEST_F(ActiveConnectTest, PhoneRefusesIsBusyOrSaysSomethingElse) {
@@ -129,7 +131,7 @@ TEST_F(ActiveConnectTest, SilenceHangUpAndRefusedConnectAreTimeouts) {
         Json refused = timeout;
         refused["connection_steps"] = "_WI:0_WF:0_TF:-1";
         EXPECT_EQ(connect("d1"), refused);
-        EXPECT_FALSE(Utils::getWlanConnState());
+        EXPECT_FALSE(ConnectionState::getWlanConnState());
     }
 }
 
@@ -178,7 +180,7 @@ TEST_F(ActiveConnectTest, SecondRequestWhileOneWaitsIsBusy) {
     control("cancelSSDPConnect");
     ASSERT_EQ(first.wait_for(kWellBeforeLong), std::future_status::ready);
     EXPECT_EQ(first.get()["error"], -10005);
-    EXPECT_TRUE(Utils::getIsCanConnectDevice());  // the slot is free again
+    EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());  // the slot is free again
 }
 
 }  // namespace

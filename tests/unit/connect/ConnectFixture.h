@@ -22,7 +22,8 @@
 #include "connect/PhoneFrame.h"
 #include "core/EventLoop.h"
 #include "core/Json.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "support/TestSupport.h"
 #include "platform/fake/FakePlatform.h"
 #include "support/TestSupport.h"
 
@@ -33,7 +34,7 @@ namespace kesu::test {
 class PcIdentityTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        Utils::resetStateForTest();
+        resetSharedStateForTest();
         fake->setLocalizedHostName("Office-Desk-PC");
         fake->addAdapter("Wi-Fi", "wlan0", "aa:bb:cc:dd:ee:ff", "192.168.1.2");
         dataInstance().update([](databaseParam& p) {
@@ -44,8 +45,8 @@ protected:
     }
     void TearDown() override {
         dataInstance().update([](databaseParam& p) { p = databaseParam(); });
-        Utils::resetStateForTest();
-        Utils::closeLog();
+        resetSharedStateForTest();
+        Log::closeLog();
     }
 
     // The PC's connection request, exactly as sent.

@@ -14,6 +14,7 @@
 #include "support/StubPcSuite.h"
 #include "unit/UnitHelpers.h"
 #include "unit/connect/ConnectFixture.h"
+#include "connect/ConnectionState.h"
 
 namespace kesu {
 namespace {
@@ -100,8 +101,8 @@ TEST_F(PhoneServer, UserAgreesAndThePcSuiteGetsThePhone) {
     const auto shown = window->next(kLong);
     ASSERT_TRUE(shown);
     EXPECT_EQ(*shown, (std::vector<std::string>{"1", "My Pad", "41424344", "138****678", "1", "pad"}));
-    EXPECT_FALSE(Utils::getIsCanConnectDevice());  // held while the request is handled
-    EXPECT_EQ(Utils::getConnectingDeviceType(), "pad");
+    EXPECT_FALSE(ConnectionState::getIsCanConnectDevice());  // held while the request is handled
+    EXPECT_EQ(ConnectionState::getConnectingDeviceType(), "pad");
 
     EXPECT_EQ(control("QtAgree", {"true"}), (Json{{"error", 0}, {"error_message", "Close"}}));
     std::string raw;
@@ -109,7 +110,7 @@ TEST_F(PhoneServer, UserAgreesAndThePcSuiteGetsThePhone) {
     EXPECT_NE(raw.find('\n'), std::string::npos);  // pretty-printed
     EXPECT_TRUE(closedByServer(*phone));
     ASSERT_TRUE(server.waitForNoLinks(kLong));
-    EXPECT_TRUE(Utils::getIsCanConnectDevice());
+    EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());
 
     // The PC suite was asked first, then got the phone.
     const auto busyCheck = pcsuite.requestsTo("/isConnectBusy");
@@ -166,7 +167,7 @@ TEST_F(PhoneServer, BusyPcSuiteAnswersByDeviceType) {
     EXPECT_EQ(answer(*pad)["bytes"], Json::array({12}));
     EXPECT_TRUE(closedByServer(*pad));
     ASSERT_TRUE(server.waitForNoLinks(kLong));
-    EXPECT_TRUE(Utils::getIsCanConnectDevice());
+    EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());
     EXPECT_EQ(test::todaysLog().find("[startAllowedWindow]"), std::string::npos);  // no window for a busy PC suite
 }
 
@@ -198,7 +199,7 @@ TEST_F(PhoneServer, SharingRequestsSkipTheAllowWindow) {
     EXPECT_EQ((*next)[5], rootedPath("/Users/recvFile"));
     EXPECT_EQ((*next)[7], "/data/other");
     ASSERT_TRUE(server.waitForNoLinks(kLong));
-    EXPECT_TRUE(Utils::getIsCanConnectDevice());  // sharing never holds the connection slot
+    EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());  // sharing never holds the connection slot
 }
 
 TEST_F(PhoneServer, BadInputIsDroppedAndEveryLinkIsClosed) {
@@ -223,7 +224,7 @@ TEST_F(PhoneServer, BadInputIsDroppedAndEveryLinkIsClosed) {
     EXPECT_TRUE(closedByServer(*silent));  // after the read time-out
     ASSERT_TRUE(server.waitForNoLinks(kLong));
     EXPECT_EQ(server.linkCount(), 0u);
-    EXPECT_TRUE(Utils::getIsCanConnectDevice());
+    EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());
     EXPECT_TRUE(pcsuite.requests().empty());
 }
 
@@ -244,7 +245,7 @@ TEST_F(PhoneServer, LinksAreBoundedAndStopEndsThem) {
     EXPECT_TRUE(closedByServer(*silent));
     EXPECT_EQ(server.linkCount(), 0u);
     EXPECT_EQ(server.port(), 0);
-    EXPECT_TRUE(Utils::getIsCanConnectDevice());
+    EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());
 
     // The server opens again.
     ASSERT_TRUE(server.ConnectStatusGet());

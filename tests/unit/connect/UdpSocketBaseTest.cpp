@@ -2,7 +2,7 @@
 #include <gtest/gtest.h>
 
 #include "connect/UdpSocketBase.h"
-#include "core/Utils.h"
+#include "core/Log.h"
 #include "support/TestSupport.h"
 #include "support/UdpCatcher.h"
 
@@ -37,7 +37,7 @@ TEST(UdpSocketBaseTest, SendsEachMessageAsOneDatagram) {
     // After close() sends fail and say so.
     EXPECT_TRUE(socket.close());
     EXPECT_FALSE(socket.sendMsg(3.0, Bytes{'y'}));
-    Utils::closeLog();
+    Log::closeLog();
 }
 
 }  // namespace

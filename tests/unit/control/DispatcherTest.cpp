@@ -10,6 +10,9 @@
 #include "support/UdpCatcher.h"
 #include "unit/UnitHelpers.h"
 #include "unit/events/EventRecorder.h"
+#include "connect/ConnectionState.h"
+#include "core/Log.h"
+#include "support/TestSupport.h"
 
 namespace kesu {
 namespace {
@@ -21,7 +24,7 @@ using Events = test::EventRecorder::Events;
 class Dispatch : public ::testing::Test {
 protected:
     void SetUp() override {
-        Utils::resetStateForTest();
+        test::resetSharedStateForTest();
         dataInstance().update([](databaseParam& p) { p = databaseParam(); });
         pcsuite.pointPcsuiteHere(env.config());
         env.config().pushClientUdpPort = push.port();
@@ -31,8 +34,8 @@ protected:
     }
     void TearDown() override {
         EventPublisher::instance().clearObservers();
-        Utils::resetStateForTest();
-        Utils::closeLog();
+        test::resetSharedStateForTest();
+        Log::closeLog();
     }
     static Json em(int error, const std::string& message) { return {{"error", error}, {"error_message", message}}; }
 
@@ -96,7 +99,7 @@ TEST_F(Dispatch, AccountChangeSignInAndSignOut) {
     ASSERT_TRUE(datagram);
     EXPECT_EQ(Json::parse(*datagram), Json({{"cmd", "QUERY_CLIENT_ID"}, {"openId", "open-1"}}));
     EXPECT_EQ(events->events(), (Events{"PcsuiteEvent", "DeviceInfoReport"}));
-    Utils::closeLog();
+    Log::closeLog();
     EXPECT_TRUE(test::logged("user info: "));
     EXPECT_EQ(test::todaysLog().find("secret-token-value"), std::string::npos);
 
@@ -128,18 +131,18 @@ TEST_F(Dispatch, AccountChangeSignInAndSignOut) {
 TEST_F(Dispatch, AllowWindowAnswersReleaseTheWaiterOnceEach) {
     EXPECT_EQ(control("QtAgree", {"true"}), em(0, "Close"));
     EXPECT_TRUE(hAllowSemaphore().try_acquire_for(1s));
-    EXPECT_TRUE(Utils::getIsAllowWindow());
-    EXPECT_TRUE(Utils::getThisPhoneAutoConnect());
+    EXPECT_TRUE(ConnectionState::getIsAllowWindow());
+    EXPECT_TRUE(ConnectionState::getThisPhoneAutoConnect());
     EXPECT_EQ(control("QtAgree", {"false"}), em(0, "Close"));
     EXPECT_TRUE(hAllowSemaphore().try_acquire_for(1s));
-    EXPECT_FALSE(Utils::getThisPhoneAutoConnect());
-    Utils::setThisPhoneAutoConnect(true);
+    EXPECT_FALSE(ConnectionState::getThisPhoneAutoConnect());
+    ConnectionState::setThisPhoneAutoConnect(true);
     EXPECT_EQ(control("QtAgree"), em(0, "Close"));  // no parameters: unchanged
     EXPECT_TRUE(hAllowSemaphore().try_acquire_for(1s));
-    EXPECT_TRUE(Utils::getThisPhoneAutoConnect());
+    EXPECT_TRUE(ConnectionState::getThisPhoneAutoConnect());
     EXPECT_EQ(control("QtRefuse"), em(0, "Refuse"));
     EXPECT_TRUE(hAllowSemaphore().try_acquire_for(1s));
-    EXPECT_FALSE(Utils::getIsAllowWindow());
+    EXPECT_FALSE(ConnectionState::getIsAllowWindow());
     EXPECT_FALSE(hAllowSemaphore().try_acquire());  // exactly one signal per answer
 
     const auto bury = pcsuite.requestsTo("/buryPoint");
@@ -150,24 +153,24 @@ TEST_F(Dispatch, AllowWindowAnswersReleaseTheWaiterOnceEach) {
 TEST_F(Dispatch, ConnectionRequestsAndBusyAnswers) {
     EXPECT_TRUE(control("connectSSDP").is_null());
     EXPECT_EQ(control("connectSSDP", {"no-such-id"})["error"], -10002);
-    EXPECT_TRUE(Utils::getIsCanConnectDevice());  // the slot is given back
-    Utils::setIsCanConnectDevice(false);
+    EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());  // the slot is given back
+    ConnectionState::setIsCanConnectDevice(false);
     EXPECT_EQ(control("connectSSDP", {"x"}),
               Json({{"error", -10001}, {"error_message", "STATE_BUSY"}, {"connection_steps", "_WI:-1"}}));
-    Utils::setIsCanConnectDevice(true);
+    ConnectionState::setIsCanConnectDevice(true);
 
     // Pre-connected connections: busy by device type, empty with no parameters.
-    Utils::setIsCanPrimaryConnectDevice(false);
-    Utils::setPrimaryConnectDeviceType("pad");
+    ConnectionState::setIsCanPrimaryConnectDevice(false);
+    ConnectionState::setPrimaryConnectDeviceType("pad");
     EXPECT_EQ(control("preconnect_connect", {"d"}), em(-10015, "PC_STATE_BUSY"));
-    Utils::setPrimaryConnectDeviceType("phone");
+    ConnectionState::setPrimaryConnectDeviceType("phone");
     EXPECT_EQ(control("preconnect_preconnect-connect", {"d"}), em(-10014, "PC_STATE_BUSY"));
-    Utils::setIsCanPrimaryConnectDevice(true);
+    ConnectionState::setIsCanPrimaryConnectDevice(true);
     EXPECT_TRUE(control("preconnect_connect").is_null());
     EXPECT_EQ(control("preconnect_connect", {"d", "x"}),
               Json({{"error", -10002}, {"error_message", "Preconnect device not find"}, {"data", ""},
                     {"connection_steps", "_WFD:-1"}}));
-    EXPECT_TRUE(Utils::getIsCanPrimaryConnectDevice());
+    EXPECT_TRUE(ConnectionState::getIsCanPrimaryConnectDevice());
 
     EXPECT_EQ(control("connectCenterEventReport", {"not", "an", "object"}), em(-10000, "Parameter error"));
     EXPECT_EQ(control("connectCenterEventCreate", "text"), em(-10000, "Parameter error"));

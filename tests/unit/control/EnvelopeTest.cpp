@@ -18,7 +18,7 @@ TEST(Envelope, LengthPrefixIsOptionalAndIgnored) {
         const requestObj r = decode(body);
         EXPECT_EQ(r.event, RequestEvent::queryAdapter) << body;
         EXPECT_EQ(r.params, Json({{"k", "v"}})) << body;
-        EXPECT_EQ(r.sourec, std::optional<std::string>("pcsuite")) << body;
+        EXPECT_EQ(r.source, std::optional<std::string>("pcsuite")) << body;
     }
     // Without a prefix, a "#" inside the JSON cuts it: only the part after it is parsed.
     EXPECT_EQ(decode(R"({"event":"HeartBeat","args":["a#b"]})").event, RequestEvent::unknown);
@@ -40,7 +40,7 @@ TEST(Envelope, CmdFormParamsByJsonTypeAndAppOnlyWhenString) {
     EXPECT_EQ(decode(R"({"event":"kpush","args":"text"})").params, Json("text"));
     EXPECT_EQ(decode(R"({"event":"kpush","args":5})").params, Json::array());
     EXPECT_EQ(decode(R"({"event":"kpush","args":null})").params, Json::array());
-    EXPECT_FALSE(decode(R"({"event":"kpush","app":7})").sourec.has_value());
+    EXPECT_FALSE(decode(R"({"event":"kpush","app":7})").source.has_value());
 }
 
 TEST(Envelope, EventNamesMatchExactly) {
@@ -90,7 +90,7 @@ TEST(ControlServer, StopRightAfterStartDoesNotHang) {
     env.config().controlPort = 0;
     for (int i = 0; i < 20; ++i) {
         HttpService service;
-        ASSERT_TRUE(service.startHttpServic());
+        ASSERT_TRUE(service.startHttpService());
         EXPECT_GT(service.port(), 0);
         service.stop();
         EXPECT_FALSE(service.isRunning());

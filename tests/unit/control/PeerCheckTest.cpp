@@ -38,7 +38,7 @@ TEST(ControlServer, AnswersItsOwnUserOnlyAndLogsRefusalsOncePerMinute) {
     test::HermeticEnv env;
     env.config().controlPort = 0;
     HttpService service;
-    ASSERT_TRUE(service.startHttpServic());
+    ASSERT_TRUE(service.startHttpService());
 
     const auto own = heartBeatAs("", service.port());
     EXPECT_EQ(own.exitStatus, 0);

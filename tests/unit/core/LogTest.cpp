@@ -7,7 +7,8 @@
 
 #include "core/Json.h"
 #include "core/TimeUtil.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "core/WallClock.h"
 #include "support/TestSupport.h"
 
 namespace kesu {
@@ -31,11 +32,11 @@ private:
 // Fixed clock for the scope.
 class ScopedClock {
 public:
-    explicit ScopedClock(Utils::Clock::time_point t) { Utils::setClock([t] { return t; }); }
-    ~ScopedClock() { Utils::setClock({}); }
+    explicit ScopedClock(WallClock::Clock::time_point t) { WallClock::setClock([t] { return t; }); }
+    ~ScopedClock() { WallClock::setClock({}); }
 };
 
-Utils::Clock::time_point utc(int y, int mo, int d, int h, int mi, int s, int ms) {
+WallClock::Clock::time_point utc(int y, int mo, int d, int h, int mi, int s, int ms) {
     std::tm tm{};
     tm.tm_year = y - 1900;
     tm.tm_mon = mo - 1;
@@ -43,15 +44,15 @@ Utils::Clock::time_point utc(int y, int mo, int d, int h, int mi, int s, int ms)
     tm.tm_hour = h;
     tm.tm_min = mi;
     tm.tm_sec = s;
-    return Utils::Clock::from_time_t(timegm(&tm)) + std::chrono::milliseconds(ms);
+    return WallClock::Clock::from_time_t(timegm(&tm)) + std::chrono::milliseconds(ms);
 }
 
 class LogFiles : public ::testing::Test {
 protected:
-    void TearDown() override { Utils::closeLog(); }
+    void TearDown() override { Log::closeLog(); }
     test::HermeticEnv env;
     std::string file(const std::string& date) const {
-        return Utils::logDirectory() + "/KesuConnService_" + date + ".log";
+        return Log::logDirectory() + "/KesuConnService_" + date + ".log";
     }
 };
 
@@ -59,18 +60,18 @@ TEST_F(LogFiles, LinesGoToTheFileOfTheGmtDate) {
     ScopedZone zone("Asia/Shanghai");  // eight hours ahead of GMT
     {
         ScopedClock clock(utc(2026, 12, 3, 23, 59, 59, 900));
-        Utils::mPrintlog("[LogTest] before midnight");
+        Log::mPrintlog("[LogTest] before midnight");
     }
     {
         // 00:30 local on the 4th is still the 3rd in GMT.
         ScopedClock clock(utc(2026, 12, 3, 16, 30, 0, 0));
-        Utils::mPrintlog("[LogTest] local morning");
+        Log::mPrintlog("[LogTest] local morning");
     }
     {
         ScopedClock clock(utc(2026, 12, 4, 0, 0, 0, 100));
-        Utils::mPrintlog("[LogTest] after midnight");
+        Log::mPrintlog("[LogTest] after midnight");
     }
-    Utils::closeLog();
+    Log::closeLog();
     const std::string day3 = test::readAll(file("2026-12-03"));
     const std::string day4 = test::readAll(file("2026-12-04"));
     EXPECT_NE(day3.find("[2026-12-04 07:59:59.900][logLoop] [LogTest] before midnight\n"), std::string::npos)
@@ -87,12 +88,12 @@ TEST_F(LogFiles, ConcurrentLinesNeverInterleave) {
     for (int t = 0; t < kThreads; ++t)
         threads.emplace_back([t] {
             for (int i = 0; i < kLines; ++i)
-                Utils::mPrintlog("[LogTest] thread " + std::to_string(t) + " line " + std::to_string(i) + " " +
+                Log::mPrintlog("[LogTest] thread " + std::to_string(t) + " line " + std::to_string(i) + " " +
                                  std::string(100, static_cast<char>('a' + t)));
         });
     for (auto& th : threads) th.join();
-    Utils::closeLog();
-    const std::string log = test::readAll(Utils::logFilePath(Utils::now()));
+    Log::closeLog();
+    const std::string log = test::readAll(Log::logFilePath(WallClock::now()));
     int count = 0;
     std::size_t start = 0;
     while (start < log.size()) {
@@ -111,14 +112,14 @@ TEST_F(LogFiles, ConcurrentLinesNeverInterleave) {
 
 TEST_F(LogFiles, MissingOrUnwritableLogDirectory) {
     testing::internal::CaptureStdout();
-    Utils::deleteOldLogFile();  // nothing to clean: said on standard output
+    Log::deleteOldLogFile();  // nothing to clean: said on standard output
     EXPECT_NE(testing::internal::GetCapturedStdout().find("get file path error: "), std::string::npos);
 
     // The log directory's place is taken by a file: lines still reach standard output.
-    fs::create_directories(fs::path(Utils::logDirectory()).parent_path());
-    std::ofstream(Utils::logDirectory()) << "not a directory";
+    fs::create_directories(fs::path(Log::logDirectory()).parent_path());
+    std::ofstream(Log::logDirectory()) << "not a directory";
     testing::internal::CaptureStdout();
-    Utils::mPrintlog("[LogTest] to stdout only");
+    Log::mPrintlog("[LogTest] to stdout only");
     EXPECT_NE(testing::internal::GetCapturedStdout().find("[logLoop] [LogTest] to stdout only"), std::string::npos);
 }
 
@@ -138,7 +139,7 @@ TEST_F(LogFiles, DailyFileStopsAtItsSizeLimitUntilTheNextDay) {
         ScopedClock clock(utc(2026, 12, 3, 10, 0, 0, 0));
         testing::internal::CaptureStdout();
         for (int i = 0; i < 20; ++i)
-            Utils::mPrintlog("[LogTest] line " + std::to_string(i) + " " + std::string(60, 'x'));
+            Log::mPrintlog("[LogTest] line " + std::to_string(i) + " " + std::string(60, 'x'));
         const std::string out = testing::internal::GetCapturedStdout();
         EXPECT_NE(out.find("[LogTest] line 19 "), std::string::npos) << "standard output gets every line";
         EXPECT_EQ(occurrences(out, kCapNotice), 1u) << out;
@@ -155,7 +156,7 @@ TEST_F(LogFiles, DailyFileStopsAtItsSizeLimitUntilTheNextDay) {
 
     {
         ScopedClock clock(utc(2026, 12, 4, 0, 0, 0, 0));
-        Utils::mPrintlog("[LogTest] next day");
+        Log::mPrintlog("[LogTest] next day");
     }
     const std::string day4 = test::readAll(file("2026-12-04"));
     EXPECT_NE(day4.find("[logLoop] [LogTest] next day\n"), std::string::npos) << day4;
@@ -167,27 +168,27 @@ TEST_F(LogFiles, RestartOnTheSameDayKeepsTheCap) {
     env.config().logFileMaxBytes = 1000;
     ScopedClock clock(utc(2026, 12, 3, 10, 0, 0, 0));
     // The notice may leave the file below the limit: a later run still adds nothing.
-    Utils::mPrintlog("[LogTest] long " + std::string(650, 'x'));
-    Utils::mPrintlog("[LogTest] too long " + std::string(400, 'y'));
-    Utils::closeLog();
+    Log::mPrintlog("[LogTest] long " + std::string(650, 'x'));
+    Log::mPrintlog("[LogTest] too long " + std::string(400, 'y'));
+    Log::closeLog();
     const std::string capped = test::readAll(file("2026-12-03"));
     ASSERT_LT(capped.size() + 100, 1000u);
     ASSERT_EQ(occurrences(capped, kCapNotice), 1u);
-    Utils::mPrintlog("[LogTest] short");
-    Utils::closeLog();
+    Log::mPrintlog("[LogTest] short");
+    Log::closeLog();
     EXPECT_EQ(test::readAll(file("2026-12-03")), capped);
 
     // A file already at the limit takes nothing, not even the notice.
     const std::string full(1000, 'z');
     std::ofstream(file("2026-12-03"), std::ios::trunc) << full;
-    Utils::mPrintlog("[LogTest] short");
-    Utils::closeLog();
+    Log::mPrintlog("[LogTest] short");
+    Log::closeLog();
     EXPECT_EQ(test::readAll(file("2026-12-03")), full);
 }
 
 TEST_F(LogFiles, OldFilesGoAfterFourteenDays) {
     ScopedClock clock(utc(2026, 12, 20, 12, 0, 0, 0));
-    const std::string dir = Utils::logDirectory();
+    const std::string dir = Log::logDirectory();
     fs::create_directories(dir);
     auto touch = [&](const std::string& name) { std::ofstream(dir + "/" + name) << "x"; };
     const std::vector<std::string> stay = {"KesuConnService_2026-12-06.log",  // 14 days
@@ -197,7 +198,7 @@ TEST_F(LogFiles, OldFilesGoAfterFourteenDays) {
     for (const auto& name : go) touch(name);
     fs::create_directories(dir + "/KesuConnService_2020-01-01.log");  // a directory: stays
 
-    Utils::deleteOldLogFile();
+    Log::deleteOldLogFile();
     for (const auto& name : stay) EXPECT_TRUE(fs::exists(dir + "/" + name)) << name;
     for (const auto& name : go) EXPECT_FALSE(fs::exists(dir + "/" + name)) << name;
     EXPECT_TRUE(fs::is_directory(dir + "/KesuConnService_2020-01-01.log"));
@@ -205,14 +206,14 @@ TEST_F(LogFiles, OldFilesGoAfterFourteenDays) {
 
 TEST_F(LogFiles, VersionFileHoldsVersionAndStartTime) {
     ScopedClock clock(utc(2026, 12, 4, 10, 0, 0, 250));
-    Utils::writeConnServiceVersion(Utils::versionCode);
+    Log::writeConnServiceVersion(Log::versionCode);
     const std::string path = rootedPath(Config::current().versionFile);
     EXPECT_EQ(path.rfind(env.root(), 0), 0u) << "written below KESU_ROOT";
     const auto content = Json::parse(test::readAll(path));
     EXPECT_EQ(content["updateTime"], timeutil::formatLocal(utc(2026, 12, 4, 10, 0, 0, 250)));
     // Rewriting replaces the content (a longer old file must not leave a tail).
     std::ofstream(path) << std::string(500, ' ') << "junk";
-    Utils::writeConnServiceVersion("1");
+    Log::writeConnServiceVersion("1");
     EXPECT_EQ(Json::parse(test::readAll(path))["version"], "1");
 }
 

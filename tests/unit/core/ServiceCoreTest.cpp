@@ -13,7 +13,11 @@
 #include "core/SingleInstance.h"
 #include "core/Json.h"
 #include "core/TimeUtil.h"
-#include "core/Utils.h"
+#include "connect/ConnectionState.h"
+#include "core/Log.h"
+#include "core/WallClock.h"
+#include "pcsuite/PcsuiteClient.h"
+#include "support/TestSupport.h"
 #include "support/ServiceProcess.h"
 #include "support/TestSupport.h"
 
@@ -35,11 +39,11 @@ TEST(SingleInstance, CountsExactlyTwoMatchingLines) {
 
 class RestartRule : public ::testing::Test {
 protected:
-    void SetUp() override { Utils::resetStateForTest(); }
+    void SetUp() override { test::resetSharedStateForTest(); }
     void TearDown() override {
-        Utils::setClock({});
-        Utils::resetStateForTest();
-        Utils::closeLog();
+        WallClock::setClock({});
+        test::resetSharedStateForTest();
+        Log::closeLog();
     }
     void writeVersion(const std::string& content) {
         const std::string path = rootedPath(Config::current().versionFile);
@@ -51,7 +55,7 @@ protected:
     }
     void now(const std::string& localTime) {
         const auto t = *timeutil::parseLocal(localTime);
-        Utils::setClock([t] { return t; });
+        WallClock::setClock([t] { return t; });
     }
     test::HermeticEnv env;
 };
@@ -96,15 +100,15 @@ TEST_F(RestartRule, OnlyLogOnWithoutConnectionTriggersTheCheck) {
     for (ServiceEvent other : {ServiceEvent::LogOut, ServiceEvent::WifiOpen, ServiceEvent::Pcsuite})
         subscriber->notify(other);
     ASSERT_TRUE(subscriber->waitIdle(5s));
-    Utils::closeLog();
-    std::string log = test::readAll(Utils::logFilePath(Utils::now()));
+    Log::closeLog();
+    std::string log = test::readAll(Log::logFilePath(WallClock::now()));
     EXPECT_EQ(log.find("Now connservice run"), std::string::npos) << log;
 
-    Utils::setIsCanConnectDevice(false);  // a connection in progress: no check
+    ConnectionState::setIsCanConnectDevice(false);  // a connection in progress: no check
     subscriber->notify(ServiceEvent::LogOn);
     ASSERT_TRUE(subscriber->waitIdle(5s));
-    Utils::closeLog();
-    log = test::readAll(Utils::logFilePath(Utils::now()));
+    Log::closeLog();
+    log = test::readAll(Log::logFilePath(WallClock::now()));
     EXPECT_EQ(log.find("restart KesuConnService"), std::string::npos) << log;
 }
 
@@ -131,23 +135,23 @@ TEST(Watchdog, RestartsAServerThatStoppedAnswering) {
     Config::current().httpWatchdogPeriod = 100ms;
     Config::current().httpRestartPause = 10ms;
     Config::current().httpAliveTimeout = 2s;
-    ASSERT_TRUE(HttpService::httpService().startHttpServic());
-    EXPECT_TRUE(Utils::isHttpAlive());
+    ASSERT_TRUE(HttpService::httpService().startHttpService());
+    EXPECT_TRUE(PcsuiteClient::isHttpAlive());
 
     EventLoop loop;
     loop.start();
     HttpAliveCheck watchdog(loop);  // the real probe: a HeartBeat to our own server
     HttpService::httpService().stop();
-    EXPECT_FALSE(Utils::isHttpAlive());
+    EXPECT_FALSE(PcsuiteClient::isHttpAlive());
     ASSERT_TRUE(watchdog.waitForRestarts(1, 10s));
-    EXPECT_TRUE(Utils::isHttpAlive());
+    EXPECT_TRUE(PcsuiteClient::isHttpAlive());
     watchdog.stop();
     // A healthy server is left alone.
     HttpAliveCheck quiet(loop);
     EXPECT_FALSE(quiet.waitForRestarts(1, 500ms));
     quiet.stop();
     HttpService::httpService().stop();
-    Utils::closeLog();
+    Log::closeLog();
 }
 
 }  // namespace

@@ -8,7 +8,14 @@
 #include <thread>
 #include <vector>
 
-#include "core/Utils.h"
+#include "connect/ConnectionState.h"
+#include "core/Endpoints.h"
+#include "core/Files.h"
+#include "core/Log.h"
+#include "core/Process.h"
+#include "core/Text.h"
+#include "platform/SystemInfo.h"
+#include "support/TestSupport.h"
 #include "platform/fake/FakePlatform.h"
 #include "support/TestSupport.h"
 
@@ -17,16 +24,16 @@ namespace {
 
 class UtilsSystem : public ::testing::Test {
 protected:
-    void SetUp() override { Utils::resetStateForTest(); }
+    void SetUp() override { test::resetSharedStateForTest(); }
     void TearDown() override {
-        Utils::resetStateForTest();
-        Utils::closeLog();
+        test::resetSharedStateForTest();
+        Log::closeLog();
     }
     // Writes the host override file where the service looks for it and reads it.
     std::string connectCenterFrom(const std::string& content) {
         env.dir().write("root" + env.config().switchHostIni, content);
-        Utils::getConnectCenterUrl();
-        return Utils::connectCenterServerUrl();
+        Endpoints::getConnectCenterUrl();
+        return Endpoints::connectCenterServerUrl();
     }
 
     test::HermeticEnv env;
@@ -35,8 +42,8 @@ protected:
 
 TEST_F(UtilsSystem, ConnectCenterOverrideFile) {
     const std::string builtIn = env.config().defaultConnectCenterUrl;
-    Utils::getConnectCenterUrl();  // no file
-    EXPECT_EQ(Utils::connectCenterServerUrl(), builtIn);
+    Endpoints::getConnectCenterUrl();  // no file
+    EXPECT_EQ(Endpoints::connectCenterServerUrl(), builtIn);
     EXPECT_EQ(connectCenterFrom("[host]\nOtherHost=https://other.test/\n"), builtIn);
 
     // A URL holding "=" survives whole; a Windows line end is not part of it; an empty
@@ -44,8 +51,8 @@ TEST_F(UtilsSystem, ConnectCenterOverrideFile) {
     const std::string url = "https://cc.test/base?region=eu";
     EXPECT_EQ(connectCenterFrom("[host]\r\nConnectionCenterHost=" + url + "\r\nnext=1\r\n"), url);
     EXPECT_EQ(connectCenterFrom("ConnectionCenterHost="), url);
-    Utils::setConnectCenterServerUrl("");
-    EXPECT_EQ(Utils::connectCenterServerUrl(), builtIn);
+    Endpoints::setConnectCenterServerUrl("");
+    EXPECT_EQ(Endpoints::connectCenterServerUrl(), builtIn);
 
     // A huge one-line file and invalid UTF-8 change nothing.
     EXPECT_EQ(connectCenterFrom("ConnectionCenterHost=" + std::string(200000, 'x')), builtIn);
@@ -53,110 +60,110 @@ TEST_F(UtilsSystem, ConnectCenterOverrideFile) {
 
     // readFile: a missing file or one that is not UTF-8 leaves the output alone.
     std::string content = "kept";
-    Utils::readFile(env.dir().str() + "/missing.txt", content);
-    EXPECT_FALSE(Utils::isFileExist(env.dir().str() + "/missing.txt"));
-    Utils::readFile(env.dir().write("bad.txt", "\xff\xfe"), content);
+    Files::readFile(env.dir().str() + "/missing.txt", content);
+    EXPECT_FALSE(Files::isFileExist(env.dir().str() + "/missing.txt"));
+    Files::readFile(env.dir().write("bad.txt", "\xff\xfe"), content);
     EXPECT_EQ(content, "kept");
 }
 
 TEST_F(UtilsSystem, MaskCountsUserPerceivedCharacters) {
-    EXPECT_EQ(Utils::paramAddMask(""), "");
-    EXPECT_EQ(Utils::paramAddMask("abcdef"), "abcdef");
-    EXPECT_EQ(Utils::paramAddMask("abcdefghij"), "abc****hij");
-    EXPECT_EQ(Utils::paramAddMask("名字是七个字符"), "名字是****个字符");
+    EXPECT_EQ(text::paramAddMask(""), "");
+    EXPECT_EQ(text::paramAddMask("abcdef"), "abcdef");
+    EXPECT_EQ(text::paramAddMask("abcdefghij"), "abc****hij");
+    EXPECT_EQ(text::paramAddMask("名字是七个字符"), "名字是****个字符");
     // A family emoji joined by zero-width joiners, a toned thumb and "e" + combining accent
     // are one character each.
     const std::string family = "\xF0\x9F\x91\xA8\xE2\x80\x8D\xF0\x9F\x91\xA9\xE2\x80\x8D\xF0\x9F\x91\xA7";
     const std::string thumb = "\xF0\x9F\x91\x8D\xF0\x9F\x8F\xBD";
-    EXPECT_EQ(Utils::paramAddMask(thumb + "abcde"), thumb + "abcde");
-    EXPECT_EQ(Utils::paramAddMask("ab" + family + "cdef"), "ab" + family + "****def");
-    EXPECT_EQ(Utils::paramAddMask("ne\xCC\x81nuphar"), "ne\xCC\x81n****har");
+    EXPECT_EQ(text::paramAddMask(thumb + "abcde"), thumb + "abcde");
+    EXPECT_EQ(text::paramAddMask("ab" + family + "cdef"), "ab" + family + "****def");
+    EXPECT_EQ(text::paramAddMask("ne\xCC\x81nuphar"), "ne\xCC\x81n****har");
 
     fake->setLocalizedHostName("Office-Desktop");
-    EXPECT_EQ(Utils::getLocalName(), "Off****top");
-    EXPECT_EQ(Utils::uintToHexString("A\n\xC3\xA9\xFF"), "410ac3a9ff");
-    EXPECT_EQ(Utils::asciiToString({0x41, 0x00, 0x7F, 0xE9, 0xFF}), std::string("A\0\x7F\xC3\xA9\xC3\xBF", 7));
+    EXPECT_EQ(SystemInfo::getLocalName(), "Off****top");
+    EXPECT_EQ(text::uintToHexString("A\n\xC3\xA9\xFF"), "410ac3a9ff");
+    EXPECT_EQ(text::asciiToString({0x41, 0x00, 0x7F, 0xE9, 0xFF}), std::string("A\0\x7F\xC3\xA9\xC3\xBF", 7));
 }
 
 TEST_F(UtilsSystem, MacAddressAndNetworkSnapshot) {
     // The first Wi-Fi adapter, else the last Ethernet one.
-    EXPECT_EQ(Utils::getMacAddress(), "");
+    EXPECT_EQ(SystemInfo::getMacAddress(), "");
     fake->addAdapter("Ethernet", "eth0", "aa:00:00:00:00:01");
     fake->addAdapter("Ethernet", "eth1", "aa:00:00:00:00:02", "10.1.0.5", "255.255.0.0");
-    EXPECT_EQ(Utils::getMacAddress(), "aa0000000002");
+    EXPECT_EQ(SystemInfo::getMacAddress(), "aa0000000002");
     fake->addAdapter("Wi-Fi", "wlan0", "bb:00:00:00:00:01");
-    EXPECT_EQ(Utils::getMacAddress(), "bb0000000001");
+    EXPECT_EQ(SystemInfo::getMacAddress(), "bb0000000001");
 
     fake->setWifiSsid("Caf\xC3\xA9");
-    EXPECT_EQ(Utils::getNetworkCorrespondAddress(),
+    EXPECT_EQ(SystemInfo::getNetworkCorrespondAddress(),
               (std::map<std::string, std::string>{{"Ethernet", "10.1.0.5"}, {"Wi-Fi", ""}}));
-    EXPECT_EQ(Utils::GetEthernetName(), "eth1");
+    EXPECT_EQ(SystemInfo::GetEthernetName(), "eth1");
     fake->addAdapter("Wi-Fi", "wlan1", "bb:00:00:00:00:02", "192.168.7.9");
-    const auto list = Utils::GetNetworkInfoList();
+    const auto list = SystemInfo::GetNetworkInfoList();
     ASSERT_EQ(list.size(), 2u);
     EXPECT_EQ(list[1], (std::map<std::string, std::string>{{"name", "Wi-Fi"},
                                                            {"bsdName", "wlan1"},
                                                            {"ip", "192.168.7.9"},
                                                            {"netmask", "255.255.255.0"},
                                                            {"ssid", "Caf\xC3\xA9"}}));
-    EXPECT_EQ(Utils::getNetworkCorrespondAddress().at("Wi-Fi"), "192.168.7.9");
-    EXPECT_EQ(Utils::GetWifiName(), "wlan1");
+    EXPECT_EQ(SystemInfo::getNetworkCorrespondAddress().at("Wi-Fi"), "192.168.7.9");
+    EXPECT_EQ(SystemInfo::GetWifiName(), "wlan1");
 
     // The address list cannot be read: nothing, and the names stay as they were.
     fake->setInterfaceAddresses(std::nullopt);
-    EXPECT_TRUE(Utils::getNetworkCorrespondAddress().empty());
-    EXPECT_TRUE(Utils::GetNetworkInfoList().empty());
-    EXPECT_EQ(Utils::GetWifiName(), "wlan1");
+    EXPECT_TRUE(SystemInfo::getNetworkCorrespondAddress().empty());
+    EXPECT_TRUE(SystemInfo::GetNetworkInfoList().empty());
+    EXPECT_EQ(SystemInfo::GetWifiName(), "wlan1");
 
     fake->setNetworkServices({{"Wi-Fi", "wlan0", ""}});
-    EXPECT_FALSE(Utils::MacWifiNetworkAvailability());
-    EXPECT_FALSE(Utils::MacEthernetNetworkAvailability());
+    EXPECT_FALSE(SystemInfo::MacWifiNetworkAvailability());
+    EXPECT_FALSE(SystemInfo::MacEthernetNetworkAvailability());
 }
 
 TEST_F(UtilsSystem, VpnFirewallScreenAndAppRules) {
     fake->setVpnScopedInterfaces({"eth0", "docker0"});
-    EXPECT_FALSE(Utils::isVpnOn());
+    EXPECT_FALSE(SystemInfo::isVpnOn());
     for (const char* name : {"utun3", "tap1", "ppp0", "ipsec0", "wg0"}) {
         fake->setVpnScopedInterfaces({"eth0", name});
-        EXPECT_TRUE(Utils::isVpnOn()) << name;
+        EXPECT_TRUE(SystemInfo::isVpnOn()) << name;
     }
 
     // The firewall state is read from tool output: unreadable or empty output is unknown.
-    EXPECT_EQ(Utils::getFirewallState(), std::nullopt);
+    EXPECT_EQ(SystemInfo::getFirewallState(), std::nullopt);
     for (const auto& [text, state] : std::vector<std::pair<std::string, std::optional<bool>>>{
              {"0\n", false}, {" 1 ", true}, {"2", true}, {"\xff", std::nullopt}, {"\n", std::nullopt}}) {
         fake->setFirewallGlobalState(text);
-        EXPECT_EQ(Utils::getFirewallState(), state) << text;
+        EXPECT_EQ(SystemInfo::getFirewallState(), state) << text;
     }
 
-    EXPECT_TRUE(Utils::isScreenUnlocked());  // unknown counts as unlocked
+    EXPECT_TRUE(SystemInfo::isScreenUnlocked());  // unknown counts as unlocked
     fake->setScreenLocked(true);
-    EXPECT_FALSE(Utils::isScreenUnlocked());
+    EXPECT_FALSE(SystemInfo::isScreenUnlocked());
     fake->setCpuVendor(std::nullopt);
-    EXPECT_EQ(Utils::GetPcSystemInfo().at("vendor"), "apple");
+    EXPECT_EQ(SystemInfo::GetPcSystemInfo().at("vendor"), "apple");
 
     // Exactly two copies is the one count read as "not running".
     const std::string app = "kesu办公套件";
-    EXPECT_TRUE(Utils::isAppRunning(app));
+    EXPECT_TRUE(SystemInfo::isAppRunning(app));
     fake->setRunningApplicationNames({app, "bash", app});
-    EXPECT_FALSE(Utils::isAppRunning(app));
+    EXPECT_FALSE(SystemInfo::isAppRunning(app));
     fake->setRunningApplicationNames({app, app, app});
-    EXPECT_TRUE(Utils::isAppRunning(app));
+    EXPECT_TRUE(SystemInfo::isAppRunning(app));
 }
 
 TEST_F(UtilsSystem, PingTakesOnlyIpv4LiteralsAndCommandsRunToTheirEnd) {
     for (const char* bad : {"8.8.8.8; rm -rf /", "localhost", "", "-c 9 127.0.0.1", "127.0.0.1 ", "::1", "1.2.3"}) {
-        EXPECT_FALSE(Utils::pingAddress(bad, 1)) << bad;
+        EXPECT_FALSE(SystemInfo::pingAddress(bad, 1)) << bad;
     }
     EXPECT_EQ(fake->pingCalls(), 0);
-    EXPECT_TRUE(Utils::pingAddress("127.0.0.1", 1));
+    EXPECT_TRUE(SystemInfo::pingAddress("127.0.0.1", 1));
     EXPECT_EQ(fake->lastPingAddress(), "127.0.0.1");
     fake->setPingResult(false);
-    EXPECT_FALSE(Utils::pingAddress("127.0.0.1", 0));
+    EXPECT_FALSE(SystemInfo::pingAddress("127.0.0.1", 0));
 
     // A program that cannot start is -1.
     int exitCode = 5;
-    EXPECT_FALSE(Utils::startProcess(env.dir().str() + "/no-such-program", {}, exitCode));
+    EXPECT_FALSE(process::startProcess(env.dir().str() + "/no-such-program", {}, exitCode));
     EXPECT_EQ(exitCode, -1);
 }
 
@@ -166,17 +173,17 @@ TEST_F(UtilsSystem, SlotAndSequenceNumbersUnderConcurrency) {
     std::vector<std::thread> threads;
     for (int t = 0; t < 8; ++t)
         threads.emplace_back([&] {
-            if (Utils::tryClaimConnectDevice()) ++winners;
-            Utils::setConnectingDeviceType("phone");
-            (void)Utils::getConnectingDeviceType();
+            if (ConnectionState::tryClaimConnectDevice()) ++winners;
+            ConnectionState::setConnectingDeviceType("phone");
+            (void)ConnectionState::getConnectingDeviceType();
         });
     for (auto& t : threads) t.join();
     EXPECT_EQ(winners.load(), 1);
-    EXPECT_FALSE(Utils::tryClaimConnectDevice());
-    Utils::setIsCanConnectDevice(true);
-    EXPECT_TRUE(Utils::tryClaimConnectDevice());
-    EXPECT_TRUE(Utils::tryClaimPrimaryConnectDevice());
-    EXPECT_FALSE(Utils::tryClaimPrimaryConnectDevice());
+    EXPECT_FALSE(ConnectionState::tryClaimConnectDevice());
+    ConnectionState::setIsCanConnectDevice(true);
+    EXPECT_TRUE(ConnectionState::tryClaimConnectDevice());
+    EXPECT_TRUE(ConnectionState::tryClaimPrimaryConnectDevice());
+    EXPECT_FALSE(ConnectionState::tryClaimPrimaryConnectDevice());
 
     // Sequence numbers: unique and without gaps across threads.
     constexpr int kThreads = 8, kEach = 2000;
@@ -184,7 +191,7 @@ TEST_F(UtilsSystem, SlotAndSequenceNumbersUnderConcurrency) {
     threads.clear();
     for (int t = 0; t < kThreads; ++t)
         threads.emplace_back([&, t] {
-            for (int i = 0; i < kEach; ++i) seen[t].push_back(Utils::getNfcLanConnectSeqNo());
+            for (int i = 0; i < kEach; ++i) seen[t].push_back(ConnectionState::getNfcLanConnectSeqNo());
         });
     for (auto& t : threads) t.join();
     std::vector<long long> all;
@@ -195,7 +202,7 @@ TEST_F(UtilsSystem, SlotAndSequenceNumbersUnderConcurrency) {
 
     // Local URLs follow the configured ports.
     env.config().pcsuitePort = 40001;
-    EXPECT_EQ(Utils::pcsuiteHttpServerSSDPQuerryAllUrl(), "http://127.0.0.1:40001/SSDPQueryAll");
+    EXPECT_EQ(Endpoints::pcsuiteHttpServerSSDPQueryAllUrl(), "http://127.0.0.1:40001/SSDPQueryAll");
 }
 
 }  // namespace

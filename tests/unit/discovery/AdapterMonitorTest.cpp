@@ -21,6 +21,7 @@
 #include "discovery/SsdpMessage.h"
 #include "support/NetNs.h"
 #include "unit/events/EventRecorder.h"
+#include "platform/SystemInfo.h"
 
 namespace kesu {
 namespace {
@@ -244,7 +245,7 @@ TEST_F(AdapterMonitor, AnnouncesThePcOnEachSocketAndHearsItself) {
     ASSERT_TRUE(datagram.starts_with("RESPONSE * HTTP/1.1\r\nDATE:"));
     const Json pc = json::parse(SsdpMessage::decodeCompatPayload(datagram)).value_or(Json());
     EXPECT_EQ(pc["deviceName"], "Off****-PC");
-    EXPECT_EQ(pc["deviceId"], Utils::getMacAddress());
+    EXPECT_EQ(pc["deviceId"], SystemInfo::getMacAddress());
     EXPECT_EQ(pc["openId"], "openid-of-this-pc");
     EXPECT_EQ(pc["account"], "138****0000");
 

@@ -13,7 +13,8 @@
 #include "account/DataInstance.h"
 #include "core/Json.h"
 #include "core/SteadyClock.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "core/WallClock.h"
 #include "discovery/Base64.h"
 #include "platform/fake/FakePlatform.h"
 #include "support/TestSupport.h"
@@ -48,20 +49,20 @@ protected:
     static constexpr double kStart = 1714550400.0;  // the clock's reading when the test starts
 
     void SetUp() override {
-        Utils::resetStateForTest();
+        resetSharedStateForTest();
         fake->setLocalizedHostName("Office-Desk-PC");  // announced as "Off****-PC"
         savedOpenId_ = dataInstance().get(&databaseParam::openid);
         dataInstance().set(&databaseParam::openid, "openid-of-this-pc");
-        Utils::setClock([this] {
-            return Utils::Clock::time_point(std::chrono::duration_cast<Utils::Clock::duration>(
+        WallClock::setClock([this] {
+            return WallClock::Clock::time_point(std::chrono::duration_cast<WallClock::Clock::duration>(
                 std::chrono::duration<double>(seconds_.load())));
         });
     }
     void TearDown() override {
-        Utils::setClock({});
+        WallClock::setClock({});
         dataInstance().set(&databaseParam::openid, savedOpenId_);
-        Utils::resetStateForTest();
-        Utils::closeLog();
+        resetSharedStateForTest();
+        Log::closeLog();
     }
 
     // Time passes: both clocks move.

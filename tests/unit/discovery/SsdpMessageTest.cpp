@@ -11,6 +11,9 @@
 #include "discovery/Base64.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/SsdpMessage.h"
+#include "core/Text.h"
+#include "core/WallClock.h"
+#include "platform/SystemInfo.h"
 
 namespace kesu {
 namespace {
@@ -34,7 +37,7 @@ using SsdpMessageTest = test::DiscoveryTest;
 TEST_F(SsdpMessageTest, AnnouncementAndSearchWireFormat) {
     const std::string msg = SsdpMessage::responseMessage("Off****-PC", "a1b2c3d4e5f6", "138****0000", "oid",
                                                          SsdpMessage::pcServiceRecord());
-    const std::string head = "RESPONSE * HTTP/1.1\r\nDATE:" + Utils::getNowTime() + "\r\ncompatGsonStr:";
+    const std::string head = "RESPONSE * HTTP/1.1\r\nDATE:" + WallClock::getNowTime() + "\r\ncompatGsonStr:";
     ASSERT_EQ(msg.substr(0, head.size()), head);
     ASSERT_EQ(msg.substr(msg.size() - 2), "\r\n");
     const std::string b64 = msg.substr(head.size(), msg.size() - head.size() - 2);
@@ -69,7 +72,7 @@ TEST_F(SsdpMessageTest, MaskingAndIdentifierRules) {
     EXPECT_TRUE(full);
     EXPECT_EQ(SsdpMessage::maskValue("ABCDEFG", full), "ABC****EFG");  // 7 is the first masked length
     EXPECT_FALSE(full);
-    // Counted in user-perceived characters (the masking itself is Utils::paramAddMask's).
+    // Counted in user-perceived characters (the masking itself is text::paramAddMask's).
     EXPECT_EQ(SsdpMessage::maskValue("e\xCC\x81" "bcdef", full), "e\xCC\x81" "bcdef");
     EXPECT_TRUE(full);
 
@@ -135,7 +138,7 @@ TEST_F(SsdpMessageTest, DatagramClassification) {
     EXPECT_EQ(table.lastOwnEcho(), SteadyClock::time_point());
 
     // The PC's own announcement looped back: not stored, but it proves the socket hears.
-    const std::string own = SsdpMessage::responseMessage(Utils::getLocalName(), "a1b2c3", "", "oid",
+    const std::string own = SsdpMessage::responseMessage(SystemInfo::getLocalName(), "a1b2c3", "", "oid",
                                                          SsdpMessage::pcServiceRecord());
     EXPECT_EQ(SsdpMessage::handleDatagram(own, host, table), Handling::ignored);
     EXPECT_EQ(table.lastOwnEcho(), clock.now());

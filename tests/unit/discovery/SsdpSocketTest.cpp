@@ -19,6 +19,7 @@
 #include "discovery/SsdpSocket.h"
 #include "discovery/SsdpSocketManager.h"
 #include "support/NetNs.h"
+#include "platform/SystemInfo.h"
 
 namespace kesu {
 namespace {
@@ -147,7 +148,7 @@ TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
     // The PC's own announcement comes back on its socket: it refreshes the own-echo time
     // stamp and is not stored.
     const auto beforeEcho = SteadyClock::system().now();
-    ASSERT_TRUE(pc.sendResponseData(Utils::getLocalName(), Utils::getMacAddress(), "", "openid-of-this-pc",
+    ASSERT_TRUE(pc.sendResponseData(SystemInfo::getLocalName(), SystemInfo::getMacAddress(), "", "openid-of-this-pc",
                                     SsdpMessage::pcServiceRecord()));
     heard = pcHeard.waitFor(3);
     ASSERT_EQ(heard.size(), 3u);

@@ -7,6 +7,8 @@
 #include "core/Text.h"
 #include "pcsuite/PcsuiteRequest.h"
 #include "unit/pcsuite/StubFixture.h"
+#include "core/Endpoints.h"
+#include "pcsuite/PcsuiteClient.h"
 
 namespace kesu {
 namespace {
@@ -55,12 +57,12 @@ TEST_F(PcsuiteRequestTest, PcDeviceInfoAndConnectDeviceAcceptOnlyTheTextCode) {
 
 TEST_F(PcsuiteRequestTest, BuryPointIsPostedUnframedAndJudgedByItsCode) {
     const std::string record = R"([{"type":1,"eventId":"W688|10308","params":{"net_type":1,"state":0}}])";
-    EXPECT_TRUE(Utils::sendBuryPoint(record));
+    EXPECT_TRUE(PcsuiteClient::sendBuryPoint(record));
     ASSERT_EQ(stub.requestsTo("/buryPoint").size(), 1u);
     EXPECT_EQ(stub.requestsTo("/buryPoint")[0].body, record);
     for (const std::string& body : {R"({"code":"000001","data":"unknown event"})", R"({"code":0})", ""}) {
         stub.setAnswer("/buryPoint", {200, body});
-        EXPECT_FALSE(Utils::sendBuryPoint(record)) << body;
+        EXPECT_FALSE(PcsuiteClient::sendBuryPoint(record)) << body;
     }
 }
 
@@ -68,7 +70,7 @@ TEST_F(PcsuiteRequestTest, DeviceConnectableAsksWithTheFramedEventAndReadsTheBus
     std::string respondType = "before";
     std::string status = "before";
     stub.setAnswer("/isConnectBusy", {200, R"({"code":"000000","data":{"isConnectBusy":false}})"});
-    EXPECT_TRUE(Utils::isDeviceConnectable("phone", respondType, status));
+    EXPECT_TRUE(PcsuiteClient::isDeviceConnectable("phone", respondType, status));
     EXPECT_EQ(status, "unconnect");
     EXPECT_EQ(respondType, "");
     auto requests = stub.requestsTo("/isConnectBusy");
@@ -79,25 +81,25 @@ TEST_F(PcsuiteRequestTest, DeviceConnectableAsksWithTheFramedEventAndReadsTheBus
 
     stub.setAnswer("/isConnectBusy",
                    {200, R"({"code":"000000","data":{"isConnectBusy":true,"connectStatus":"connected","deviceType":"pad"}})"});
-    EXPECT_FALSE(Utils::isDeviceConnectable("pad", respondType, status));
+    EXPECT_FALSE(PcsuiteClient::isDeviceConnectable("pad", respondType, status));
     EXPECT_EQ(status, "connected");
     EXPECT_EQ(respondType, "pad");
     stub.setAnswer("/isConnectBusy", {200, R"({"code":"000002","data":"no license"})"});
-    EXPECT_FALSE(Utils::isDeviceConnectable("phone", respondType, status));
+    EXPECT_FALSE(PcsuiteClient::isDeviceConnectable("phone", respondType, status));
 
     // An empty answer does not hold the connection back.
     stub.setAnswer("/isConnectBusy", {200, ""});
-    EXPECT_TRUE(Utils::isDeviceConnectable("phone", respondType, status));
+    EXPECT_TRUE(PcsuiteClient::isDeviceConnectable("phone", respondType, status));
 
     // A device type is a query value, never part of the request line.
-    EXPECT_TRUE(Utils::isDeviceConnectable("a b&c", respondType, status));
+    EXPECT_TRUE(PcsuiteClient::isDeviceConnectable("a b&c", respondType, status));
     EXPECT_EQ(stub.requestsTo("/isConnectBusy").back().param("deviceType"), "a b&c");
 }
 
 TEST_F(PcsuiteRequestTest, ConnectToPhoneAlreadyReadsTheNumberAfterTheHash) {
     int code = -5;
     stub.setAnswer("/", {200, "1#2", "text/plain"});
-    EXPECT_TRUE(Utils::isConnectToPhoneAlready(code));
+    EXPECT_TRUE(PcsuiteClient::isConnectToPhoneAlready(code));
     EXPECT_EQ(code, 2);
     ASSERT_EQ(stub.requestsTo("/").size(), 1u);
     EXPECT_EQ(stub.requestsTo("/")[0].body, R"(40#{"event":"checkCurrentPhone","args":[0]})");
@@ -105,7 +107,7 @@ TEST_F(PcsuiteRequestTest, ConnectToPhoneAlreadyReadsTheNumberAfterTheHash) {
     for (const std::string& body : {"12", "", "1#", "3#abc", "15#{\"code\":1}", "1#99999999999999999999"}) {
         code = -5;
         stub.setAnswer("/", {200, body, "text/plain"});
-        EXPECT_FALSE(Utils::isConnectToPhoneAlready(code)) << body;
+        EXPECT_FALSE(PcsuiteClient::isConnectToPhoneAlready(code)) << body;
         EXPECT_EQ(code, -5) << body;
     }
 }
@@ -113,8 +115,8 @@ TEST_F(PcsuiteRequestTest, ConnectToPhoneAlreadyReadsTheNumberAfterTheHash) {
 TEST_F(PcsuiteRequestTest, HttpMsgSendUsesTheGivenMethodUrlAndBody) {
     std::string response = "unchanged";
     const std::string list = R"({"deviceList":[{"deviceId":"d1"}]})";
-    EXPECT_TRUE(Utils::httpMsgSend(list, Utils::pcsuiteHttpServerSSDPQuerryAllUrl(), "POST", response));
-    EXPECT_TRUE(Utils::httpMsgSend("{}", Utils::pcsuiteHttpServerNotifySystemEventUrl(), "PUT", response));
+    EXPECT_TRUE(PcsuiteClient::httpMsgSend(list, Endpoints::pcsuiteHttpServerSSDPQueryAllUrl(), "POST", response));
+    EXPECT_TRUE(PcsuiteClient::httpMsgSend("{}", Endpoints::pcsuiteHttpServerNotifySystemEventUrl(), "PUT", response));
     EXPECT_EQ(response, "unchanged");
     const auto requests = stub.requests();
     ASSERT_EQ(requests.size(), 2u);
@@ -128,19 +130,19 @@ TEST_F(PcsuiteRequestTest, HttpAliveSendsTheHeartBeatToTheControlServer) {
     test::StubPcSuite control;
     control.pointControlHere(env.config());
     control.setAnswer("/", {200, R"(34#{"code":0,"msg":"","data":"Alive"})", "text/plain"});
-    EXPECT_TRUE(Utils::isHttpAlive());
+    EXPECT_TRUE(PcsuiteClient::isHttpAlive());
     ASSERT_EQ(control.requestCount(), 1u);
     EXPECT_EQ(control.requests()[0].body, R"(32#{"event":"HeartBeat","args":[0]})");
     EXPECT_EQ(stub.requestCount(), 0u);  // nothing went to the PC suite
     control.stop();
-    EXPECT_FALSE(Utils::isHttpAlive());
+    EXPECT_FALSE(PcsuiteClient::isHttpAlive());
 
     // The service's real control server answers it.
     env.config().controlPort = 0;
     HttpService service;
-    ASSERT_TRUE(service.startHttpServic());
+    ASSERT_TRUE(service.startHttpService());
     env.config().controlPort = service.port();
-    EXPECT_TRUE(Utils::isHttpAlive());
+    EXPECT_TRUE(PcsuiteClient::isHttpAlive());
     service.stop();
 }
 
@@ -152,16 +154,16 @@ TEST_F(PcsuiteRequestTest, PcSuiteDownOrHungGivesTheFailureAnswers) {
         std::string status = "s";
         int code = -5;
         std::string response;
-        EXPECT_TRUE(Utils::isDeviceConnectable("phone", respondType, status)) << what;
+        EXPECT_TRUE(PcsuiteClient::isDeviceConnectable("phone", respondType, status)) << what;
         EXPECT_EQ(respondType, "t") << what;
         EXPECT_EQ(status, "s") << what;
-        EXPECT_FALSE(Utils::sendBuryPoint("[{}]")) << what;
-        EXPECT_FALSE(Utils::isConnectToPhoneAlready(code)) << what;
+        EXPECT_FALSE(PcsuiteClient::sendBuryPoint("[{}]")) << what;
+        EXPECT_FALSE(PcsuiteClient::isConnectToPhoneAlready(code)) << what;
         EXPECT_EQ(code, -5) << what;
-        EXPECT_FALSE(Utils::httpMsgSend("{}", Utils::pcsuiteHttpServerSSDPQuerryAllUrl(), "POST", response)) << what;
+        EXPECT_FALSE(PcsuiteClient::httpMsgSend("{}", Endpoints::pcsuiteHttpServerSSDPQueryAllUrl(), "POST", response)) << what;
         EXPECT_FALSE(PcsuiteRequest::getPcDeviceInfo().has_value()) << what;
         EXPECT_FALSE(PcsuiteRequest::startConnectPreDevice({{"deviceId", "d"}}).has_value()) << what;
-        EXPECT_FALSE(RequestBase::urlSessionPost("{}", Utils::pcsuiteHttpServerUrl())) << what;
+        EXPECT_FALSE(RequestBase::urlSessionPost("{}", Endpoints::pcsuiteHttpServerUrl())) << what;
     };
 
     // Hung: every answer would come (as a success) only after the limits.

@@ -6,6 +6,7 @@
 
 #include "pcsuite/RequestBase.h"
 #include "unit/pcsuite/StubFixture.h"
+#include "core/Log.h"
 
 namespace kesu {
 namespace {
@@ -172,7 +173,7 @@ TEST(RequestBaseHttps, VerifiesTheServerCertificate) {
     EXPECT_EQ(msg, "ok");
     ASSERT_EQ(secure.requestCount(), 1u);
     EXPECT_EQ(secure.requests()[0].body, "{}");
-    Utils::closeLog();
+    Log::closeLog();
 }
 
 }  // namespace

@@ -6,7 +6,7 @@
 
 #include <chrono>
 
-#include "core/Utils.h"
+#include "core/Log.h"
 #include "support/StubPcSuite.h"
 #include "support/TestSupport.h"
 #include "unit/UnitHelpers.h"
@@ -23,7 +23,7 @@ protected:
         env.config().http429Pause = 50ms;
         stub.pointPcsuiteHere(env.config());
     }
-    void TearDown() override { Utils::closeLog(); }
+    void TearDown() override { Log::closeLog(); }
 
     HermeticEnv env;
     StubPcSuite stub;

@@ -17,7 +17,8 @@
 #include <thread>
 
 #include "core/Process.h"
-#include "core/Utils.h"
+#include "core/Log.h"
+#include "platform/SystemInfo.h"
 #include "platform/linux/LinuxPlatform.h"
 #include "support/TestSupport.h"
 
@@ -68,7 +69,7 @@ private:
 class LinuxPlatformTest : public ::testing::Test {
 protected:
     void SetUp() override { Platform::install(nullptr); }
-    void TearDown() override { Utils::closeLog(); }
+    void TearDown() override { Log::closeLog(); }
     test::HermeticEnv env;
     std::unique_ptr<Platform> platform = makeLinuxPlatform();
 };
@@ -192,10 +193,10 @@ TEST_F(LinuxPlatformTest, RealInterfacesAndProcesses) {
     };
     const pid_t first = start();
     EXPECT_EQ(countOf(), 1);
-    EXPECT_TRUE(Utils::isAppRunning(name));
+    EXPECT_TRUE(SystemInfo::isAppRunning(name));
     const pid_t second = start();
     EXPECT_EQ(countOf(), 2);
-    EXPECT_FALSE(Utils::isAppRunning(name));
+    EXPECT_FALSE(SystemInfo::isAppRunning(name));
     for (pid_t pid : {first, second}) {
         ::kill(pid, SIGKILL);
         ::waitpid(pid, nullptr, 0);
@@ -276,20 +277,20 @@ bool ip(const std::vector<std::string>& args) {
 TEST_F(LinuxPlatformTest, PingLoopbackAndUnansweredLoopback) {
     if (!process::findProgram("ping")) GTEST_SKIP() << "no ping";
     EXPECT_TRUE(platform->ping("127.0.0.1", 2s));
-    EXPECT_TRUE(Utils::pingAddress("127.0.0.1", 2));
+    EXPECT_TRUE(SystemInfo::pingAddress("127.0.0.1", 2));
 
     if (::geteuid() != 0 || !process::findProgram("ip")) GTEST_SKIP() << "needs root and ip";
     bool ran = false;
     const bool entered = inPrivateNetwork([&] {
         // Loopback down: no route at all, the ping fails.
-        EXPECT_FALSE(Utils::pingAddress("127.0.0.1", 1));
+        EXPECT_FALSE(SystemInfo::pingAddress("127.0.0.1", 1));
         // Loopback up but echo requests ignored in this namespace: the ping goes unanswered
         // until the time-out.
         if (!ip({"link", "set", "lo", "up"})) return;
         std::ofstream ignore("/proc/sys/net/ipv4/icmp_echo_ignore_all");
         if (!(ignore << "1" << std::flush)) return;
         ran = true;
-        EXPECT_FALSE(Utils::pingAddress("127.0.0.1", 1));
+        EXPECT_FALSE(SystemInfo::pingAddress("127.0.0.1", 1));
         EXPECT_FALSE(platform->ping("127.0.0.1", 1s));
     });
     if (!entered || !ran) GTEST_SKIP() << "network namespaces are not available here";

@@ -21,7 +21,7 @@ public:
     explicit operator bool() const { return load(); }
 
 private:
-    friend class Pcuitinterface;
+    friend class PcsuiteInterface;
     // Makes `client`, on `loop`, the running attempt's link; returns the flag as it is now.
     bool attach(std::shared_ptr<SocketClient> client, EventLoop& loop);
     void detach();
@@ -34,7 +34,7 @@ private:
 
 CancelFlag& SSDPcancel();
 
-class Pcuitinterface {
+class PcsuiteInterface {
 public:
     // The event loop the attempts' links run on; the service sets it when it starts and
     // clears it (nullptr) when it stops. Without one an attempt fails at the connect step.

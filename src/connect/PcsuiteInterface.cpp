@@ -1,4 +1,4 @@
-#include "connect/Pcuitinterface.h"
+#include "connect/PcsuiteInterface.h"
 
 #include <asio/co_spawn.hpp>
 
@@ -11,7 +11,8 @@
 #include "core/Config.h"
 #include "core/EventLoop.h"
 #include "core/Json.h"
-#include "core/Utils.h"
+#include "connect/ConnectionState.h"
+#include "core/Log.h"
 #include "discovery/SsdpDeviceManager.h"
 
 namespace kesu {
@@ -63,18 +64,18 @@ std::string busyReply() {
 
 }  // namespace
 
-void Pcuitinterface::setLoop(EventLoop* loop) { attemptLoop.store(loop); }
+void PcsuiteInterface::setLoop(EventLoop* loop) { attemptLoop.store(loop); }
 
-std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
+std::string PcsuiteInterface::ActiveConnect(const std::string& stringId) {
     std::unique_lock<std::mutex> oneAttempt(attemptMutex(), std::try_to_lock);
     if (!oneAttempt.owns_lock()) {
-        Utils::mPrintlog("[ActiveConnect] another connection is in progress, " + stringId + " is answered busy \n");
+        Log::mPrintlog("[ActiveConnect] another connection is in progress, " + stringId + " is answered busy \n");
         return busyReply();
     }
 
     const Step& step = sharedStep();
     const Config& config = Config::current();
-    Utils::setWlanConnState(false);
+    ConnectionState::setWlanConnState(false);
     SSDPcancel() = false;
     const auto deadline = SocketClient::Clock::now() + config.activeConnectTimeout;
     Json reply = {{"error", 0}, {"error_message", ""}, {"connection_steps", ""}};
@@ -91,18 +92,18 @@ std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
     SsdpDevicePtr device;
     if (!SsdpDeviceManager::instance().ssdpDeviceMap.lookup(stringId, device) || !device) {
         const std::string text = "[ActiveConnect] address_ " + stringId + " find ssdp device error not find";
-        Utils::mPrintlog("[ActiveConnect] Error occur as: " + text + "\n");
+        Log::mPrintlog("[ActiveConnect] Error occur as: " + text + "\n");
         steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::FAILED);
         return finish(rawValue(ErrorCode::NOT_FOUND), "errir_message", text);
     }
     if (device->ip.empty() || device->ip.front().empty()) {
         // Known from an announcement that carried no usable sender address: nothing to dial.
         const std::string text = "[ActiveConnect] address_ " + stringId + " ssdp device has no address";
-        Utils::mPrintlog("[ActiveConnect] Error occur as: " + text + "\n");
+        Log::mPrintlog("[ActiveConnect] Error occur as: " + text + "\n");
         steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::FAILED);
         return finish(rawValue(ErrorCode::NOT_FOUND), "error_message", text);
     }
-    Utils::setConnectingDeviceType(device->deviceType);
+    ConnectionState::setConnectingDeviceType(device->deviceType);
 
     // The attempt's link is reachable by a cancel request until the attempt returns.
     struct AttachGuard {
@@ -110,7 +111,7 @@ std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
     };
     EventLoop* const loop = attemptLoop.load();
     if (loop == nullptr || !loop->running()) {
-        Utils::mPrintlog("[ActiveConnect] the service's event loop is not running, no link can be made \n");
+        Log::mPrintlog("[ActiveConnect] the service's event loop is not running, no link can be made \n");
         steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::OK) + step.getConnectCode(step.WLAN_CONNECT_SERVER) +
                  step.getConnectResult(step.WLAN_CONNECT_SERVER, Result::FAILED);
         return finish(rawValue(ErrorCode::TIMEOUT), "error_message",
@@ -120,14 +121,14 @@ std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
     const auto work = std::make_shared<ClientWorkAct>(std::make_shared<SocketClient>(loop->executor()));
     AttachGuard attached;
     if (SSDPcancel().attach(work->ClientShared, *loop)) {
-        Utils::mPrintlog("[ActiveConnect] cancel before initTcp \n");
+        Log::mPrintlog("[ActiveConnect] cancel before initTcp \n");
         steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::CANCEL);
         return finish(rawValue(ErrorCode::CANCEL), "errir_message", "CANCEL");
     }
     steps += step.getConnectResult(step.WLAN_FIND_DEVICES, Result::OK) + step.getConnectCode(step.WLAN_CONNECT_SERVER);
 
     const std::string& ip = device->ip.front();
-    Utils::mPrintlog("[ActiveConnect] Enter the accept event waiting! \n");
+    Log::mPrintlog("[ActiveConnect] Enter the accept event waiting! \n");
     // The exchange runs on the loop; this (control API) thread waits for its outcome. The
     // deadline bounds the exchange itself, the margin only a loop that ends meanwhile.
     auto result = std::make_shared<std::promise<ClientWorkAct::Outcome>>();
@@ -148,17 +149,17 @@ std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
     }
     const auto disconnect = [&] { loop->call([work] { work->ClientDisConnServer(); }); };
     const bool cancelled = SSDPcancel().load();
-    Utils::mPrintlog(outcome == ClientWorkAct::Outcome::Answered || cancelled
+    Log::mPrintlog(outcome == ClientWorkAct::Outcome::Answered || cancelled
                          ? "[ActiveConnect]accept event success \n"
                          : "[ActiveConnect]accept event timedOut \n");
-    Utils::mPrintlog("[ActiveConnect] Leave the accept event waiting! \n");
+    Log::mPrintlog("[ActiveConnect] Leave the accept event waiting! \n");
 
     if (outcome == ClientWorkAct::Outcome::ConnectFailed && !cancelled) {
         // The phone's port could not be reached: no answer can come, and the connect step
         // is reported as failed.
         disconnect();
         steps += step.getConnectResult(step.WLAN_CONNECT_SERVER, Result::FAILED);
-        Utils::mPrintlog("[ActiveConnect] return_code_ " + std::to_string(rawValue(ConnectTag::TIMEOUT)) +
+        Log::mPrintlog("[ActiveConnect] return_code_ " + std::to_string(rawValue(ConnectTag::TIMEOUT)) +
                          " , timeout \n");
         return finish(rawValue(ErrorCode::TIMEOUT), "error_message",
                       "[SSDP search] connect timeout or phone wake up pcsuite failed.");
@@ -166,38 +167,38 @@ std::string Pcuitinterface::ActiveConnect(const std::string& stringId) {
     steps += step.getConnectResult(step.WLAN_CONNECT_SERVER, Result::OK) + step.getConnectCode(step.WLAN_RECV_RESPONSE);
 
     if (cancelled) {
-        Utils::mPrintlog("[ActiveConnect] cancel before return code \n");
+        Log::mPrintlog("[ActiveConnect] cancel before return code \n");
         disconnect();
         steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::CANCEL);
         return finish(rawValue(ErrorCode::CANCEL), "errir_message", "CANCEL");
     }
 
     const std::string text = work->ClientShared->ServerMessageReceive();
-    Utils::mPrintlog("[TCP Positive Conn] " + text);
+    Log::mPrintlog("[TCP Positive Conn] " + text);
     const ConnectTag answer = classifyPhoneAnswer(text);
     const std::string code = std::to_string(rawValue(answer));
     disconnect();
 
     switch (answer) {
     case ConnectTag::PHONEAGREE:
-        Utils::mPrintlog("[ActiveConnect] phone is accepted the request, phone ip is : " + describeList(device->ip));
+        Log::mPrintlog("[ActiveConnect] phone is accepted the request, phone ip is : " + describeList(device->ip));
         steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::OK);
         reply["data"] = ip;
         {
             const std::string result = finish(0, "error_message", "");
-            Utils::mPrintlog("connect success : " + result);
+            Log::mPrintlog("connect success : " + result);
             return result;
         }
     case ConnectTag::BUSY:
-        Utils::mPrintlog("[ActiveConnect] return_code_ " + code + " , phone is busy \n");
+        Log::mPrintlog("[ActiveConnect] return_code_ " + code + " , phone is busy \n");
         steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::BUSY);
         return finish(rawValue(ErrorCode::STATE_BUSY), "error_message", "[SSDP search] phone is busy.");
     case ConnectTag::PHONEREJECT:
-        Utils::mPrintlog("[ActiveConnect] return_code_ " + code + " \n");
+        Log::mPrintlog("[ActiveConnect] return_code_ " + code + " \n");
         steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::REJECT);
         return finish(rawValue(ErrorCode::REJECT), "error_message", "[SSDP search] phone reject the connect.");
     default:
-        Utils::mPrintlog("[ActiveConnect] return_code_ " + code + " , timeout \n");
+        Log::mPrintlog("[ActiveConnect] return_code_ " + code + " , timeout \n");
         steps += step.getConnectResult(step.WLAN_RECV_RESPONSE, Result::TIMEOUT);
         return finish(rawValue(ErrorCode::TIMEOUT), "error_message",
                       "[SSDP search] connect timeout or phone wake up pcsuite failed.");

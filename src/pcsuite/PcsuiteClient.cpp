@@ -1,6 +1,5 @@
-// The Utils requests that wait for the PC suite's (or the control server's) answer: bury
-// points, the busy checks, device lists and system events, and the control server's
-// HeartBeat.
+#include "pcsuite/PcsuiteClient.h"
+
 #include <cctype>
 #include <charconv>
 #include <cstdint>
@@ -9,7 +8,8 @@
 #include "core/Config.h"
 #include "core/Json.h"
 #include "core/Text.h"
-#include "core/Utils.h"
+#include "core/Endpoints.h"
+#include "core/Log.h"
 #include "pcsuite/PcsuiteRequest.h"
 #include "pcsuite/RequestBase.h"
 
@@ -28,13 +28,13 @@ RequestBase::Answer waitForAnswer(const std::string& url, const std::string& bod
 }
 
 std::string answerText(const RequestBase::Answer& answer) {
-    return Utils::asciiToString(std::vector<std::uint8_t>(answer.body.begin(), answer.body.end()));
+    return text::asciiToString(std::vector<std::uint8_t>(answer.body.begin(), answer.body.end()));
 }
 
 // An event request framed "N#json" ("" when it cannot be framed).
 std::string framedEvent(const Ordered& event) {
     std::string framed;
-    Utils::RebuildEventData(event.dump(-1, ' ', false, Ordered::error_handler_t::replace), framed);
+    PcsuiteClient::RebuildEventData(event.dump(-1, ' ', false, Ordered::error_handler_t::replace), framed);
     return framed;
 }
 
@@ -71,43 +71,43 @@ bool isSuccessCode(const Json& answer) { return json::str(answer, "code") == raw
 
 }  // namespace
 
-bool Utils::RebuildEventData(const std::string& str, std::string& finalStr) {
+bool PcsuiteClient::RebuildEventData(const std::string& str, std::string& finalStr) {
     if (str.empty()) return false;
     finalStr = text::lengthPrefixed(str);
     return true;
 }
 
-bool Utils::sendBuryPoint(const std::string& data) {
+bool PcsuiteClient::sendBuryPoint(const std::string& data) {
     const RequestBase::Answer answer =
-        waitForAnswer(pcsuiteHttpServerUrl() + "buryPoint", data, Config::current().httpWaitTimeout);
+        waitForAnswer(Endpoints::pcsuiteHttpServerUrl() + "buryPoint", data, Config::current().httpWaitTimeout);
     if (!answer.responded) {
-        mPrintlog("[sendBuryPoint] http client respond data is empty! \n");
+        Log::mPrintlog("[sendBuryPoint] http client respond data is empty! \n");
         return false;
     }
-    mPrintlog("[sendBuryPoint] http client have respond data! \n");
+    Log::mPrintlog("[sendBuryPoint] http client have respond data! \n");
     const std::string text = answerText(answer);
     if (text.empty()) return false;
     const Json reply = json::parse(text).value_or(Json());
     if (isSuccessCode(reply)) return true;
-    mPrintlog("[sendBuryPoint] bury point error message: " + json::text(reply.is_object() ? reply.value("data", Json())
+    Log::mPrintlog("[sendBuryPoint] bury point error message: " + json::text(reply.is_object() ? reply.value("data", Json())
                                                                                           : Json()) +
               " \n");
     return false;
 }
 
-bool Utils::isDeviceConnectable(const std::string& deviceType, std::string& respondDeviceType,
+bool PcsuiteClient::isDeviceConnectable(const std::string& deviceType, std::string& respondDeviceType,
                                 std::string& connectStatus) {
     Ordered event = Ordered::object();
     event["event"] = "DeviceConnectable";
     event["deviceType"] = Ordered::array({deviceType});
-    const RequestBase::Answer answer = waitForAnswer(pcsuiteHttpIsConnectBusyUrl() + queryEncoded(deviceType),
+    const RequestBase::Answer answer = waitForAnswer(Endpoints::pcsuiteHttpIsConnectBusyUrl() + queryEncoded(deviceType),
                                                      framedEvent(event), Config::current().httpWaitTimeout);
     if (!answer.responded) {
         // A PC suite that is not there does not hold a connection back.
-        mPrintlog("[isDeviceConnectable] http client respond data is empty! \n");
+        Log::mPrintlog("[isDeviceConnectable] http client respond data is empty! \n");
         return true;
     }
-    mPrintlog("[isDeviceConnectable] http client have respond data! \n");
+    Log::mPrintlog("[isDeviceConnectable] http client have respond data! \n");
     const std::string text = answerText(answer);
     if (text.empty()) return true;
     const Json reply = json::parse(text).value_or(Json());
@@ -118,27 +118,27 @@ bool Utils::isDeviceConnectable(const std::string& deviceType, std::string& resp
             respondDeviceType.clear();
             return true;
         }
-        mPrintlog("[isDeviceConnectable] current pc is connect busy! \n");
+        Log::mPrintlog("[isDeviceConnectable] current pc is connect busy! \n");
         connectStatus = json::str(data, "connectStatus");
         respondDeviceType = json::str(data, "deviceType");
         return false;
     }
-    mPrintlog("[isDeviceConnectable] pc have reject to connect as " +
+    Log::mPrintlog("[isDeviceConnectable] pc have reject to connect as " +
               json::text(reply.is_object() ? reply.value("data", Json()) : Json()) + " \n");
     return false;
 }
 
-bool Utils::isConnectToPhoneAlready(int& responseCode) {
+bool PcsuiteClient::isConnectToPhoneAlready(int& responseCode) {
     Ordered event = Ordered::object();
     event["event"] = "checkCurrentPhone";
     event["args"] = Ordered::array({0});
     const RequestBase::Answer answer =
-        waitForAnswer(pcsuiteHttpServerUrl(), framedEvent(event), Config::current().httpWaitTimeout);
+        waitForAnswer(Endpoints::pcsuiteHttpServerUrl(), framedEvent(event), Config::current().httpWaitTimeout);
     if (!answer.responded) {
-        mPrintlog("[isConnectToPhoneAlready] http client respond data is empty! \n");
+        Log::mPrintlog("[isConnectToPhoneAlready] http client respond data is empty! \n");
         return false;
     }
-    mPrintlog("[isConnectToPhoneAlready] http client have respond data! \n");
+    Log::mPrintlog("[isConnectToPhoneAlready] http client have respond data! \n");
     const std::string text = answerText(answer);
     const auto hash = text.find('#');
     if (text.empty() || hash == std::string::npos) return false;
@@ -148,27 +148,27 @@ bool Utils::isConnectToPhoneAlready(int& responseCode) {
     return true;
 }
 
-bool Utils::isHttpAlive() {
+bool PcsuiteClient::isHttpAlive() {
     Ordered event = Ordered::object();
     event["event"] = "HeartBeat";
     event["args"] = Ordered::array({0});
     const RequestBase::Answer answer =
-        waitForAnswer(kesuConnHttpServerUrl(), framedEvent(event), Config::current().httpAliveTimeout);
+        waitForAnswer(Endpoints::kesuConnHttpServerUrl(), framedEvent(event), Config::current().httpAliveTimeout);
     if (answer.responded) {
-        mPrintlog("[isHttpAlive] http client have respond data, http service is alive! \n");
+        Log::mPrintlog("[isHttpAlive] http client have respond data, http service is alive! \n");
         return true;
     }
-    mPrintlog("[isHttpAlive] http client respond data is empty, http control service is stopped! \n");
+    Log::mPrintlog("[isHttpAlive] http client respond data is empty, http control service is stopped! \n");
     return false;
 }
 
-bool Utils::httpMsgSend(const std::string& data, const std::string& url, const std::string& method,
+bool PcsuiteClient::httpMsgSend(const std::string& data, const std::string& url, const std::string& method,
                         std::string& /*response*/) {
-    mPrintlog("[Utils::httpMsgSend] Send http request url: " + url + ", body: " + RequestBase::maskForLog(data) +
+    Log::mPrintlog("[Utils::httpMsgSend] Send http request url: " + url + ", body: " + RequestBase::maskForLog(data) +
               "\n");
     const RequestBase::Answer answer = waitForAnswer(url, data, Config::current().httpWaitTimeout, method);
     if (answer.responded) return true;
-    mPrintlog("[Utils::httpMsgSend] httpMsgSend but no response return\n");
+    Log::mPrintlog("[Utils::httpMsgSend] httpMsgSend but no response return\n");
     return false;
 }
 
