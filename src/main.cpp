@@ -1,3 +1,3 @@
-#include "core/ServiceMain.h"
+#include "app/ServiceMain.h"
 
 int main() { return kesu::runService(); }

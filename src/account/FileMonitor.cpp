@@ -23,7 +23,7 @@
 
 #include "account/DataGet.h"
 #include "account/DataInstance.h"
-#include "connect/UdpSocketBase.h"
+#include "core/UdpSocketBase.h"
 #include "core/Config.h"
 #include "core/EventLoop.h"
 #include "core/Json.h"

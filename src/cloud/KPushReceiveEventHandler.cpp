@@ -8,6 +8,6 @@ KPushReceiveEventHandler& KPushReceiveEventHandler::instance() {
 }
 
 // Push-triggered pre-connection is not built yet: push messages get the empty answer.
-std::string KPushReceiveEventHandler::kpushInfoHandler(const requestObj&) { return {}; }
+std::string KPushReceiveEventHandler::kpushInfoHandler(const Json&) { return {}; }
 
 }  // namespace kesu

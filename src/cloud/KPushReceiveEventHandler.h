@@ -3,7 +3,7 @@
 
 #include <string>
 
-#include "control/RequestEvent.h"
+#include "core/Json.h"
 
 namespace kesu {
 
@@ -11,7 +11,7 @@ class KPushReceiveEventHandler {
 public:
     static KPushReceiveEventHandler& instance();
     // The answer text for one relayed push message.
-    std::string kpushInfoHandler(const requestObj& request);
+    std::string kpushInfoHandler(const Json& params);
 };
 
 }  // namespace kesu

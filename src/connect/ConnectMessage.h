@@ -8,8 +8,8 @@
 #include <string_view>
 #include <vector>
 
-#include "connect/ConnectCodes.h"
-#include "connect/ISocketBase.h"
+#include "core/ConnectCodes.h"
+#include "core/ISocketBase.h"
 #include "core/Json.h"
 
 namespace kesu {

@@ -14,7 +14,7 @@
 #include <string>
 #include <vector>
 
-#include "connect/ConnectCodes.h"
+#include "core/ConnectCodes.h"
 #include "connect/ConnectMessage.h"
 
 namespace kesu {

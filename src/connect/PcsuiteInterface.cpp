@@ -4,7 +4,7 @@
 
 #include <future>
 
-#include "connect/ConnectCodes.h"
+#include "core/ConnectCodes.h"
 #include "connect/ConnectMessage.h"
 #include "connect/SocketClient.h"
 #include "connect/Step.h"

@@ -12,7 +12,7 @@
 
 #include <nlohmann/json.hpp>
 
-#include "connect/ISocketBase.h"
+#include "core/ISocketBase.h"
 
 namespace kesu {
 

@@ -16,7 +16,7 @@
 #include <optional>
 #include <string>
 
-#include "connect/ISocketBase.h"
+#include "core/ISocketBase.h"
 #include "connect/PhoneFrame.h"
 
 namespace kesu {

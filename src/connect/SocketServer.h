@@ -16,7 +16,7 @@
 #include <mutex>
 #include <set>
 
-#include "connect/ConnectCodes.h"
+#include "core/ConnectCodes.h"
 #include "connect/LaunchService.h"
 #include "connect/PhoneLink.h"
 

@@ -7,7 +7,7 @@
 
 #include <nlohmann/json.hpp>
 
-#include "connect/ConnectCodes.h"
+#include "core/ConnectCodes.h"
 
 namespace kesu {
 

@@ -4,10 +4,10 @@
 #include "cloud/ConnectCenterRequest.h"
 #include "cloud/KPushReceiveEventHandler.h"
 #include "connect/AllowWindow.h"
-#include "connect/ConnectCodes.h"
+#include "core/ConnectCodes.h"
 #include "connect/PcsuiteInterface.h"
 #include "connect/Step.h"
-#include "connect/UdpSocketBase.h"
+#include "core/UdpSocketBase.h"
 #include "core/Config.h"
 #include "core/Text.h"
 #include "connect/ConnectionState.h"
@@ -18,7 +18,7 @@
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/StateCheck.h"
 #include "events/EventPublisher.h"
-#include "pcsuite/DeviceReports.h"
+#include "reports/DeviceReports.h"
 #include "preconnect/ConnectFlow.h"
 #include "preconnect/DeviceWaitForPreConnectManager.h"
 #include "preconnect/StrategyDevicePreconnect.h"
@@ -365,7 +365,7 @@ std::string ResponseHandler::create(const requestObj& request) {
         case RequestEvent::kpush:
             Log::mPrintlog("kpush Request ...");
             Log::mPrintlog("kpush data is " + json::compact(request.params));
-            return KPushReceiveEventHandler::instance().kpushInfoHandler(request);
+            return KPushReceiveEventHandler::instance().kpushInfoHandler(request.params);
         case RequestEvent::enable:
             Log::mPrintlog("enable request, open wifi switch ... \n");
             return response(0, SystemInfo::openWifi() ? "enable wifi success" : "enable wifi failed");

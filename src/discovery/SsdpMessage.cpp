@@ -3,7 +3,7 @@
 #include <memory>
 
 #include "account/DataInstance.h"
-#include "connect/ConnectCodes.h"
+#include "core/ConnectCodes.h"
 #include "core/Config.h"
 #include "core/Text.h"
 #include "core/Log.h"

@@ -9,7 +9,7 @@
 #include <string>
 #include <string_view>
 
-#include "connect/ISocketBase.h"
+#include "core/ISocketBase.h"
 
 namespace kesu {
 

@@ -1,6 +1,6 @@
 #include "preconnect/ConnectFlow.h"
 
-#include "connect/ConnectCodes.h"
+#include "core/ConnectCodes.h"
 #include "connect/Step.h"
 #include "core/Log.h"
 #include "discovery/StateCheck.h"

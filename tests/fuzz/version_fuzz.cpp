@@ -10,7 +10,7 @@
 #include <string>
 
 #include "core/Json.h"
-#include "core/RestartServiceSubscriber.h"
+#include "app/RestartServiceSubscriber.h"
 #include "core/TimeUtil.h"
 
 namespace {

@@ -14,7 +14,7 @@
 #include <sstream>
 #include <stdexcept>
 
-#include "pcsuite/DeviceListReporter.h"
+#include "reports/DeviceListReporter.h"
 
 namespace kesu::test {
 

@@ -8,7 +8,7 @@
 #include <thread>
 #include <vector>
 
-#include "connect/ConnectCodes.h"
+#include "core/ConnectCodes.h"
 #include "connect/StepsConfig.h"
 #include "support/TestSupport.h"
 

@@ -1,7 +1,7 @@
 // The datagram socket: real datagrams to a loopback receiver, and the ends of its life.
 #include <gtest/gtest.h>
 
-#include "connect/UdpSocketBase.h"
+#include "core/UdpSocketBase.h"
 #include "core/Log.h"
 #include "support/TestSupport.h"
 #include "support/UdpCatcher.h"

@@ -8,9 +8,9 @@
 
 #include "control/HttpService.h"
 #include "core/EventLoop.h"
-#include "core/HttpAliveCheck.h"
-#include "core/RestartServiceSubscriber.h"
-#include "core/SingleInstance.h"
+#include "app/HttpAliveCheck.h"
+#include "app/RestartServiceSubscriber.h"
+#include "app/SingleInstance.h"
 #include "core/Json.h"
 #include "core/TimeUtil.h"
 #include "connect/ConnectionState.h"

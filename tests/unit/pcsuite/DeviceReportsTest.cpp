@@ -8,10 +8,10 @@
 #include <string>
 
 #include "core/EventLoop.h"
-#include "core/ServiceManager.h"
+#include "app/ServiceManager.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/SsdpMessage.h"
-#include "pcsuite/DeviceReports.h"
+#include "reports/DeviceReports.h"
 #include "preconnect/DeviceWaitForPreConnectManager.h"
 #include "support/StubPcSuite.h"
 #include "unit/discovery/DiscoveryFixture.h"

@@ -1,17 +1,12 @@
-#include "core/ServiceMain.h"
+#include "app/ServiceMain.h"
 
 #include <signal.h>
 
 #include <cstring>
 #include <string>
 
-#include "account/DataGet.h"
-#include "account/FileMonitor.h"
-#include "control/HttpService.h"
-#include "core/EventLoop.h"
-#include "core/HttpAliveCheck.h"
-#include "core/ServiceManager.h"
-#include "core/SingleInstance.h"
+#include "app/Application.h"
+#include "app/SingleInstance.h"
 #include "core/Endpoints.h"
 #include "core/Log.h"
 #include "platform/SystemInfo.h"
@@ -38,25 +33,14 @@ int runService() {
     Log::writeConnServiceVersion(Log::versionCode);
     Log::deleteOldLogFile();
     SystemInfo::GetPcSystemInfo();
-    HttpService::httpService().startHttpService();
-    EventLoop loop;
-    loop.start();
-    fileMonitorStart(loop);
-    updateHistoryDevice();
-
-    ServiceManager manager(loop);
-    manager.start();
-    HttpAliveCheck watchdog(loop);
+    Application application;
+    application.start();
 
     int signalNumber = 0;
     while (sigwait(&stopSignals, &signalNumber) != 0) {
     }
     Log::mPrintlog("[服务启动] signal " + std::string(strsignal(signalNumber)) + " received, stopping");
-    watchdog.stop();
-    manager.stop();
-    fileMonitorStop();
-    HttpService::httpService().stop();
-    loop.stop();
+    application.stop();
     Log::mPrintlog("[服务启动] stopped");
     Log::closeLog();
     return 0;

@@ -1,4 +1,4 @@
-#include "core/RestartServiceSubscriber.h"
+#include "app/RestartServiceSubscriber.h"
 
 #include "core/Config.h"
 #include "core/Json.h"

@@ -2,5 +2,5 @@
 // observers of the discovered-device table that send the LAN list again.
 #pragma once
 
-#include "pcsuite/DeviceListReporter.h"
-#include "pcsuite/WlanDeviceObservers.h"
+#include "reports/DeviceListReporter.h"
+#include "reports/WlanDeviceObservers.h"

@@ -1,4 +1,4 @@
-#include "pcsuite/DeviceListReporter.h"
+#include "reports/DeviceListReporter.h"
 
 #include <asio/steady_timer.hpp>
 

@@ -1,4 +1,4 @@
-#include "connect/UdpSocketBase.h"
+#include "core/UdpSocketBase.h"
 
 #include <arpa/inet.h>
 #include <netdb.h>

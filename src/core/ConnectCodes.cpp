@@ -1,4 +1,4 @@
-#include "connect/ConnectCodes.h"
+#include "core/ConnectCodes.h"
 
 #include <array>
 #include <utility>

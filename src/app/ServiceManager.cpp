@@ -1,15 +1,15 @@
-#include "core/ServiceManager.h"
+#include "app/ServiceManager.h"
 
 #include "connect/PcsuiteInterface.h"
 #include "connect/SocketServer.h"
 #include "core/Config.h"
 #include "core/EventLoop.h"
-#include "core/RestartServiceSubscriber.h"
+#include "app/RestartServiceSubscriber.h"
 #include "events/EventDetected.h"
 #include "events/SystemEventSubscriber.h"
 #include "core/Log.h"
 #include "discovery/ServiceWorker.h"
-#include "pcsuite/DeviceReports.h"
+#include "reports/DeviceReports.h"
 #include "events/EventPublisher.h"
 #include "preconnect/PreConnectEventSubscriber.h"
 

@@ -1,4 +1,4 @@
-#include "core/SingleInstance.h"
+#include "app/SingleInstance.h"
 
 #include "core/Text.h"
 #include "platform/Platform.h"

@@ -1,10 +1,10 @@
-#include "pcsuite/WlanDeviceObservers.h"
+#include "reports/WlanDeviceObservers.h"
 
 #include <algorithm>
 
 #include "core/EventLoop.h"
 #include "discovery/SsdpDeviceManager.h"
-#include "pcsuite/DeviceListReporter.h"
+#include "reports/DeviceListReporter.h"
 
 namespace kesu {
 

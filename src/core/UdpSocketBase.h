@@ -8,7 +8,7 @@
 #include <mutex>
 #include <string>
 
-#include "connect/ISocketBase.h"
+#include "core/ISocketBase.h"
 
 namespace kesu {
 

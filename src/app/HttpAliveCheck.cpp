@@ -1,4 +1,4 @@
-#include "core/HttpAliveCheck.h"
+#include "app/HttpAliveCheck.h"
 
 #include <asio/steady_timer.hpp>
 
