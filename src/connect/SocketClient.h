@@ -60,7 +60,7 @@ public:
     explicit ClientWorkAct(std::shared_ptr<SocketClient> client) : ClientShared(std::move(client)) {}
 
     // Connects to ip:Port, sends the connection request frame and reads the phone's answer,
-    // all before the deadline. Sets Utils' wlanConnState by the connect's result.
+    // all before the deadline. Sets the connection state's wlanConnState by the connect's result.
     // `stopRequested` is asked after the connect and after the send.
     asio::awaitable<Outcome> ClientReqServer(std::uint16_t Port, std::string ip, Clock::time_point deadline,
                                              std::function<bool()> stopRequested = {});

@@ -1,4 +1,4 @@
-// Logging, log-file housekeeping, the version file and the clock of Utils.
+// Logging, log-file housekeeping and the version file.
 #include <spdlog/details/file_helper.h>
 #include <spdlog/logger.h>
 #include <spdlog/sinks/base_sink.h>
