@@ -79,18 +79,12 @@ TEST_F(ConnectE2E, PhoneAnswersShapeTheConnectReply) {
                     {"errir_message", "[ActiveConnect] address_ 00000000 find ssdp device error not find"},
                     {"connection_steps", "_WI:0_WF:-1"}}));
 
-    // What the phone was asked: exactly the request members, from the signed-in account.
+    // What the phone was asked carries the signed-in account (the request's exact members are
+    // checked on the wire in ActiveConnectTest).
     const json request = bodyOf(*acceptSim, "SIM TCP_REQUEST ");
     ASSERT_TRUE(request.is_object()) << acceptSim->output();
-    EXPECT_EQ(request["bytes"], json::array({0}));
-    EXPECT_EQ(request["channel"], 0);
-    EXPECT_EQ(request["id"], 87654321);
-    EXPECT_EQ(request["type"], 1);
-    EXPECT_EQ(request["service_id"], "com.kesu.pcsuite.SERVICE");
     EXPECT_EQ(request["open_Id"], "pc-open");
     EXPECT_EQ(request["account"], "139****678");
-    EXPECT_TRUE(request["deviceName"].is_string() && request["target_id"].is_string());
-    EXPECT_EQ(request.size(), 9u) << request;
 }
 
 // A phone that never answers: the reply comes at the 30 s deadline, and meanwhile a second

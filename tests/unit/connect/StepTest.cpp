@@ -22,7 +22,6 @@ TEST(StepCatalogue, PreConnectionStepsAndTheSharedCatalogueIsBuiltOnce) {
     // The pre-connection steps come from the second catalogue, keys without "OS4_".
     EXPECT_EQ(s.getConnectCode(s.OS4_WLAN_FIND_DEVICES) + s.getConnectResult(s.OS4_WLAN_FIND_DEVICES, "PRECONNECT_ERROR"),
               "_WFD:-10");
-    EXPECT_EQ(s.getConnectCodeV2(s.OS4_WLAN_SEND_REQUEST), "WSR");
     // A result the step does not have adds nothing rather than a malformed ":".
     EXPECT_EQ(s.getConnectResult(s.WLAN_CONNECT_SERVER, Result::BUSY), "");
 
@@ -56,9 +55,7 @@ TEST(ConnectCodes, UnknownValuesAreRefused) {
     EXPECT_EQ(parseErrorCode(-10011), std::nullopt);
     EXPECT_EQ(parseConnectTag(13), std::nullopt);
     EXPECT_EQ(parseAppSource(3), std::nullopt);
-    EXPECT_EQ(parseServiceId("com.kesu.share.CONNECT_PC"), serviceId::shareId);
     EXPECT_EQ(parseServiceId("com.kesu.pcsuite"), std::nullopt);
-    EXPECT_EQ(parseResult("REJECT"), Result::REJECT);
     EXPECT_EQ(parseResult("ok"), std::nullopt);
 }
 

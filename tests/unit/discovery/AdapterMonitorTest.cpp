@@ -216,8 +216,6 @@ TEST_F(AdapterMonitor, SocketFollowsItsAdapterToAnotherInterface) {
 // Ethernet is the loopback interface here, so the announcement really goes out and comes
 // back: the PC hears itself, and that keeps its socket from being rebuilt.
 TEST_F(AdapterMonitor, AnnouncesThePcOnEachSocketAndHearsItself) {
-    const std::string savedPhone = dataInstance().get(&databaseParam::Phone);
-    dataInstance().set(&databaseParam::Phone, "138****0000");
     network({{"Ethernet", "lo", "127.0.0.1"}});
 
     std::mutex m;
@@ -243,17 +241,15 @@ TEST_F(AdapterMonitor, AnnouncesThePcOnEachSocketAndHearsItself) {
 
     const std::string datagram = heard.front();
     ASSERT_TRUE(datagram.starts_with("RESPONSE * HTTP/1.1\r\nDATE:"));
+    // The body's text is checked where it is built, the account's fields end to end.
     const Json pc = json::parse(SsdpMessage::decodeCompatPayload(datagram)).value_or(Json());
     EXPECT_EQ(pc["deviceName"], "Off****-PC");
     EXPECT_EQ(pc["deviceId"], SystemInfo::getMacAddress());
-    EXPECT_EQ(pc["openId"], "openid-of-this-pc");
-    EXPECT_EQ(pc["account"], "138****0000");
 
     const auto socketBefore = monitor.managerFor("lo");
     advance(30.0);  // 80 s after the start, 30 s after the echo
     monitor.checkNetWorkStatus();
     EXPECT_EQ(monitor.managerFor("lo"), socketBefore);
-    dataInstance().set(&databaseParam::Phone, savedPhone);
 }
 
 // A rebuild closes the socket at once and opens the new one when the pause has passed, on

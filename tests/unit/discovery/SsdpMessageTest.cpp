@@ -80,15 +80,8 @@ TEST_F(SsdpMessageTest, MaskingAndIdentifierRules) {
     EXPECT_EQ(SsdpMessage::deviceIdentifier("\xE8\xAE\xBE\xE5\xA4\x87" "12ZZ"), "e8aebee5a4873132");
 }
 
+// An ordinary phone's record is checked where it is posted (DeviceReportsTest) and end to end.
 TEST_F(SsdpMessageTest, CurrentFormatParse) {
-    SsdpDevice d;
-    ASSERT_TRUE(SsdpMessage::parserResponseData(json::compact(phone("abcdefgh")), d));
-    EXPECT_EQ(d.deviceName, "X1 Pro");  // the brand prefix goes
-    EXPECT_EQ(d.deviceId, "61626364");
-    EXPECT_EQ(d.account, "138****000");
-    EXPECT_EQ(d.guide, "G1");
-    EXPECT_EQ(d.deviceType, "phone");
-
     SsdpDevice p;
     ASSERT_TRUE(SsdpMessage::parserResponseData(
         json::compact(Json{{"deviceName", "kesuABCDEFG"}, {"deviceType", "pad"}, {"account", 42}, {"deviceId", "x"}}), p));

@@ -112,20 +112,6 @@ TEST_F(PcsuiteRequestTest, ConnectToPhoneAlreadyReadsTheNumberAfterTheHash) {
     }
 }
 
-TEST_F(PcsuiteRequestTest, HttpMsgSendUsesTheGivenMethodUrlAndBody) {
-    std::string response = "unchanged";
-    const std::string list = R"({"deviceList":[{"deviceId":"d1"}]})";
-    EXPECT_TRUE(PcsuiteClient::httpMsgSend(list, Endpoints::pcsuiteHttpServerSSDPQueryAllUrl(), "POST", response));
-    EXPECT_TRUE(PcsuiteClient::httpMsgSend("{}", Endpoints::pcsuiteHttpServerNotifySystemEventUrl(), "PUT", response));
-    EXPECT_EQ(response, "unchanged");
-    const auto requests = stub.requests();
-    ASSERT_EQ(requests.size(), 2u);
-    EXPECT_EQ(requests[0].path, "/SSDPQueryAll");
-    EXPECT_EQ(requests[0].body, list);
-    EXPECT_EQ(requests[1].method, "PUT");
-    EXPECT_EQ(requests[1].path, "/notifySystemEvent");
-}
-
 TEST_F(PcsuiteRequestTest, HttpAliveSendsTheHeartBeatToTheControlServer) {
     test::StubPcSuite control;
     control.pointControlHere(env.config());

@@ -122,15 +122,6 @@ TEST_F(RequestBaseTest, NoResponseKeepsTheCallersStatusAndMsg) {
     EXPECT_EQ(RequestBase::post("127.0.0.1:9/", "x", std::nullopt, {}, status, msg), timeout);
 }
 
-TEST_F(RequestBaseTest, UrlSessionPostReportsWhetherAnAnswerCame) {
-    stub.setAnswer("/", {200, ""});
-    EXPECT_TRUE(RequestBase::urlSessionPost(R"({"phone":"p1"})", stub.baseUrl()));
-    ASSERT_EQ(stub.requestCount(), 1u);
-    EXPECT_EQ(stub.requests()[0].body, R"({"phone":"p1"})");
-    const std::string closed = "http://127.0.0.1:" + std::to_string(test::freeTcpPort()) + "/";
-    EXPECT_FALSE(RequestBase::urlSessionPost("x", closed));
-}
-
 TEST(RequestBaseMask, CredentialsAreMaskedForTheLog) {
     const std::string masked = RequestBase::maskForLog(R"({"userId":"u1","token":"abcdefghijklmnop","n":{"accessToken":"qrstuvwxyz123"}})");
     EXPECT_EQ(masked.find("abcdefghijklmnop"), std::string::npos);
