@@ -48,7 +48,7 @@ TEST_F(PcsuiteRequestTest, PcDeviceInfoAndConnectDeviceAcceptOnlyTheTextCode) {
 
     // Anything but the six-character text is a refusal: the number 0, another code, no code,
     // an answer that is not JSON.
-    for (const std::string& body : {R"({"code":0,"data":{"deviceId":"PC-1"}})", R"({"code":"000001"})",
+    for (const char* body : {R"({"code":0,"data":{"deviceId":"PC-1"}})", R"({"code":"000001"})",
                                    R"({"code":"0"})", R"({"data":{}})", "000000"}) {
         stub.setAnswer("/pcDeviceInfo", {200, body});
         EXPECT_FALSE(PcsuiteRequest::getPcDeviceInfo().has_value()) << body;
@@ -60,7 +60,7 @@ TEST_F(PcsuiteRequestTest, BuryPointIsPostedUnframedAndJudgedByItsCode) {
     EXPECT_TRUE(PcsuiteClient::sendBuryPoint(record));
     ASSERT_EQ(stub.requestsTo("/buryPoint").size(), 1u);
     EXPECT_EQ(stub.requestsTo("/buryPoint")[0].body, record);
-    for (const std::string& body : {R"({"code":"000001","data":"unknown event"})", R"({"code":0})", ""}) {
+    for (const char* body : {R"({"code":"000001","data":"unknown event"})", R"({"code":0})", ""}) {
         stub.setAnswer("/buryPoint", {200, body});
         EXPECT_FALSE(PcsuiteClient::sendBuryPoint(record)) << body;
     }
@@ -104,7 +104,7 @@ TEST_F(PcsuiteRequestTest, ConnectToPhoneAlreadyReadsTheNumberAfterTheHash) {
     ASSERT_EQ(stub.requestsTo("/").size(), 1u);
     EXPECT_EQ(stub.requestsTo("/")[0].body, R"(40#{"event":"checkCurrentPhone","args":[0]})");
 
-    for (const std::string& body : {"12", "", "1#", "3#abc", "15#{\"code\":1}", "1#99999999999999999999"}) {
+    for (const char* body : {"12", "", "1#", "3#abc", "15#{\"code\":1}", "1#99999999999999999999"}) {
         code = -5;
         stub.setAnswer("/", {200, body, "text/plain"});
         EXPECT_FALSE(PcsuiteClient::isConnectToPhoneAlready(code)) << body;

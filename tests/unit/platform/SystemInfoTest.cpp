@@ -1,4 +1,4 @@
-// The system side of Utils over the fake platform: the connect-center override file, masking,
+// What the service tells about the PC over the fake platform: the connect-center override file, masking,
 // MAC selection, network snapshots, the firewall/VPN/ping rules, the connection slot and the
 // sequence numbers under concurrency.
 #include <gtest/gtest.h>
@@ -22,7 +22,7 @@
 namespace kesu {
 namespace {
 
-class UtilsSystem : public ::testing::Test {
+class SystemInfoTest : public ::testing::Test {
 protected:
     void SetUp() override { test::resetSharedStateForTest(); }
     void TearDown() override {
@@ -40,7 +40,7 @@ protected:
     ScopedFakePlatform fake;
 };
 
-TEST_F(UtilsSystem, ConnectCenterOverrideFile) {
+TEST_F(SystemInfoTest, ConnectCenterOverrideFile) {
     const std::string builtIn = env.config().defaultConnectCenterUrl;
     Endpoints::getConnectCenterUrl();  // no file
     EXPECT_EQ(Endpoints::connectCenterServerUrl(), builtIn);
@@ -66,7 +66,7 @@ TEST_F(UtilsSystem, ConnectCenterOverrideFile) {
     EXPECT_EQ(content, "kept");
 }
 
-TEST_F(UtilsSystem, MaskCountsUserPerceivedCharacters) {
+TEST_F(SystemInfoTest, MaskCountsUserPerceivedCharacters) {
     EXPECT_EQ(text::paramAddMask(""), "");
     EXPECT_EQ(text::paramAddMask("abcdef"), "abcdef");
     EXPECT_EQ(text::paramAddMask("abcdefghij"), "abc****hij");
@@ -85,7 +85,7 @@ TEST_F(UtilsSystem, MaskCountsUserPerceivedCharacters) {
     EXPECT_EQ(text::asciiToString({0x41, 0x00, 0x7F, 0xE9, 0xFF}), std::string("A\0\x7F\xC3\xA9\xC3\xBF", 7));
 }
 
-TEST_F(UtilsSystem, MacAddressAndNetworkSnapshot) {
+TEST_F(SystemInfoTest, MacAddressAndNetworkSnapshot) {
     // The first Wi-Fi adapter, else the last Ethernet one.
     EXPECT_EQ(SystemInfo::getMacAddress(), "");
     fake->addAdapter("Ethernet", "eth0", "aa:00:00:00:00:01");
@@ -120,7 +120,7 @@ TEST_F(UtilsSystem, MacAddressAndNetworkSnapshot) {
     EXPECT_FALSE(SystemInfo::MacEthernetNetworkAvailability());
 }
 
-TEST_F(UtilsSystem, VpnFirewallScreenAndAppRules) {
+TEST_F(SystemInfoTest, VpnFirewallScreenAndAppRules) {
     fake->setVpnScopedInterfaces({"eth0", "docker0"});
     EXPECT_FALSE(SystemInfo::isVpnOn());
     for (const char* name : {"utun3", "tap1", "ppp0", "ipsec0", "wg0"}) {
@@ -151,7 +151,7 @@ TEST_F(UtilsSystem, VpnFirewallScreenAndAppRules) {
     EXPECT_TRUE(SystemInfo::isAppRunning(app));
 }
 
-TEST_F(UtilsSystem, PingTakesOnlyIpv4LiteralsAndCommandsRunToTheirEnd) {
+TEST_F(SystemInfoTest, PingTakesOnlyIpv4LiteralsAndCommandsRunToTheirEnd) {
     for (const char* bad : {"8.8.8.8; rm -rf /", "localhost", "", "-c 9 127.0.0.1", "127.0.0.1 ", "::1", "1.2.3"}) {
         EXPECT_FALSE(SystemInfo::pingAddress(bad, 1)) << bad;
     }
@@ -167,7 +167,7 @@ TEST_F(UtilsSystem, PingTakesOnlyIpv4LiteralsAndCommandsRunToTheirEnd) {
     EXPECT_EQ(exitCode, -1);
 }
 
-TEST_F(UtilsSystem, SlotAndSequenceNumbersUnderConcurrency) {
+TEST_F(SystemInfoTest, SlotAndSequenceNumbersUnderConcurrency) {
     // Of many threads racing for the connection slot, exactly one gets it.
     std::atomic<int> winners{0};
     std::vector<std::thread> threads;
