@@ -15,7 +15,8 @@ Application::~Application() { stop(); }
 void Application::start() {
     if (started_) return;
     started_ = true;
-    HttpService::httpService().startHttpService();
+    controlServer_ = std::make_unique<HttpService>();
+    controlServer_->startHttpService();
     loop_ = std::make_unique<EventLoop>();
     loop_->start();
     // The account is read before discovery starts, so that the first announcement carries it.
@@ -23,7 +24,7 @@ void Application::start() {
     updateHistoryDevice();
     workers_ = std::make_unique<ServiceManager>(*loop_);
     workers_->start();
-    watchdog_ = std::make_unique<HttpAliveCheck>(*loop_);
+    watchdog_ = std::make_unique<HttpAliveCheck>(*loop_, *controlServer_);
 }
 
 void Application::stop() {
@@ -34,7 +35,8 @@ void Application::stop() {
     if (workers_) workers_->stop();
     workers_.reset();
     fileMonitorStop();
-    HttpService::httpService().stop();
+    if (controlServer_) controlServer_->stop();
+    controlServer_.reset();
     if (loop_) loop_->stop();
     loop_.reset();
 }

@@ -8,6 +8,7 @@ namespace kesu {
 
 class EventLoop;
 class HttpAliveCheck;
+class HttpService;
 class ServiceManager;
 
 class Application {
@@ -25,6 +26,7 @@ public:
 
 private:
     bool started_ = false;
+    std::unique_ptr<HttpService> controlServer_;
     std::unique_ptr<EventLoop> loop_;
     std::unique_ptr<ServiceManager> workers_;
     std::unique_ptr<HttpAliveCheck> watchdog_;

@@ -14,7 +14,8 @@
 namespace kesu {
 
 struct HttpAliveCheck::State : std::enable_shared_from_this<State> {
-    State(EventLoop& l, std::function<bool()> p) : loop(l), probe(std::move(p)), pause(l.context()) {}
+    State(EventLoop& l, HttpService& s, std::function<bool()> p)
+        : loop(l), server(s), probe(std::move(p)), pause(l.context()) {}
 
     // Loop: one round, HeartBeat then (when it failed) stop, pause, start.
     void check() {
@@ -27,13 +28,13 @@ struct HttpAliveCheck::State : std::enable_shared_from_this<State> {
         loop.offload([self] { return self->probe(); }, [self](bool alive) {
             if (alive || self->isStopped()) return self->finish(false);
             Log::mPrintlog("[CheckHttpAlive::keepCheckHttpAlive] Http is stop! Restart http service!");
-            self->loop.offload([] { HttpService::httpService().stop(); }, [self] {
+            self->loop.offload([self] { self->server.stop(); }, [self] {
                 if (self->isStopped()) return self->finish(false);
                 self->pause.expires_after(Config::current().httpRestartPause);
                 self->pause.async_wait([self](const std::error_code& error) {
                     if (error || self->isStopped()) return self->finish(false);
                     // A failure to start is retried next round.
-                    self->loop.offload([] { HttpService::httpService().startHttpService(); },
+                    self->loop.offload([self] { self->server.startHttpService(); },
                                        [self] { self->finish(true); });
                 });
             });
@@ -51,6 +52,7 @@ struct HttpAliveCheck::State : std::enable_shared_from_this<State> {
     }
 
     EventLoop& loop;
+    HttpService& server;
     const std::function<bool()> probe;
     asio::steady_timer pause;  // loop only
 
@@ -61,8 +63,8 @@ struct HttpAliveCheck::State : std::enable_shared_from_this<State> {
     int restarts = 0;
 };
 
-HttpAliveCheck::HttpAliveCheck(EventLoop& loop, std::function<bool()> probe)
-    : state_(std::make_shared<State>(loop, probe ? std::move(probe)
+HttpAliveCheck::HttpAliveCheck(EventLoop& loop, HttpService& server, std::function<bool()> probe)
+    : state_(std::make_shared<State>(loop, server, probe ? std::move(probe)
                                                  : std::function<bool()>([] { return PcsuiteClient::isHttpAlive(); }))),
       timer_(loop.context(), [] { return Config::current().httpWatchdogPeriod; },
              [state = state_] { state->check(); }) {

@@ -13,12 +13,13 @@
 namespace kesu {
 
 class EventLoop;
+class HttpService;
 
 class HttpAliveCheck {
 public:
-    // Starts the watchdog; `probe` answers whether the server is alive (the real check
-    // unless a test gives another).
-    explicit HttpAliveCheck(EventLoop& loop, std::function<bool()> probe = {});
+    // Starts the watchdog of `server`; `probe` answers whether the server is alive (the
+    // real check unless a test gives another).
+    HttpAliveCheck(EventLoop& loop, HttpService& server, std::function<bool()> probe = {});
     ~HttpAliveCheck();  // stop()
     HttpAliveCheck(const HttpAliveCheck&) = delete;
     HttpAliveCheck& operator=(const HttpAliveCheck&) = delete;

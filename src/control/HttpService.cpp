@@ -20,11 +20,6 @@ namespace kesu {
 HttpService::HttpService() = default;
 HttpService::~HttpService() { stop(); }
 
-HttpService& HttpService::httpService() {
-    static HttpService* service = new HttpService();
-    return *service;
-}
-
 std::string HttpService::handleBody(const std::string& body) {
     try {
         requestObj request;

@@ -23,9 +23,6 @@ public:
     HttpService(const HttpService&) = delete;
     HttpService& operator=(const HttpService&) = delete;
 
-    // The process-wide server every start, stop and restart goes through.
-    static HttpService& httpService();
-
     // Creates and starts the server if there is none. False when it could not listen.
     bool startHttpService();
     // Stops the server (if any) and waits for its listener to end.

@@ -135,22 +135,23 @@ TEST(Watchdog, RestartsAServerThatStoppedAnswering) {
     Config::current().httpWatchdogPeriod = 100ms;
     Config::current().httpRestartPause = 10ms;
     Config::current().httpAliveTimeout = 2s;
-    ASSERT_TRUE(HttpService::httpService().startHttpService());
+    HttpService server;
+    ASSERT_TRUE(server.startHttpService());
     EXPECT_TRUE(PcsuiteClient::isHttpAlive());
 
     EventLoop loop;
     loop.start();
-    HttpAliveCheck watchdog(loop);  // the real probe: a HeartBeat to our own server
-    HttpService::httpService().stop();
+    HttpAliveCheck watchdog(loop, server);  // the real probe: a HeartBeat to our own server
+    server.stop();
     EXPECT_FALSE(PcsuiteClient::isHttpAlive());
     ASSERT_TRUE(watchdog.waitForRestarts(1, 10s));
     EXPECT_TRUE(PcsuiteClient::isHttpAlive());
     watchdog.stop();
     // A healthy server is left alone.
-    HttpAliveCheck quiet(loop);
+    HttpAliveCheck quiet(loop, server);
     EXPECT_FALSE(quiet.waitForRestarts(1, 500ms));
     quiet.stop();
-    HttpService::httpService().stop();
+    server.stop();
     Log::closeLog();
 }
 
