@@ -3,6 +3,8 @@
 // that is down, slow or throttling, and the account's tokens kept out of the log.
 #include <gtest/gtest.h>
 
+#include <cstdlib>
+
 #include "account/DataInstance.h"
 #include "cloud/ConnectCenterRequest.h"
 #include "core/Endpoints.h"
@@ -213,6 +215,40 @@ TEST_F(ConnectCenterRequestTest, SurvivesACenterThatIsDownSlowOrThrottling) {
     center.setAnswer("/device/report", {200, R"({"code":0})"});
     EXPECT_TRUE(ConnectCenterRequest::reportDevice(Json::array(), status, msg));
     EXPECT_EQ(center.requestCount(), 2u);
+}
+
+// https: the center's certificate is checked against the system's trust store (here a test CA
+// handed to OpenSSL's default locations) and must name the host that was asked.
+TEST_F(ConnectCenterRequestTest, HttpsTrustsTheSystemStoreAndChecksTheName) {
+    const std::string dir = env.dir().str();
+    const auto sh = [](const std::string& command) { return std::system((command + " >/dev/null 2>&1").c_str()) == 0; };
+    const std::string ec = " -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes";
+    bool made = sh("openssl req -x509" + ec + " -keyout " + dir + "/ca.key -out " + dir + "/ca.pem -days 2 -subj /CN=TestCA");
+    for (const std::string name : {"good", "other"}) {
+        const std::string san = name == "good" ? "IP:127.0.0.1" : "DNS:other.example";
+        made = made && sh("openssl req" + ec + " -keyout " + dir + "/" + name + ".key -out " + dir + "/" + name +
+                          ".csr -subj /CN=" + name) &&
+               !env.dir().write(name + ".ext", "subjectAltName=" + san + "\n").empty() &&
+               sh("openssl x509 -req -in " + dir + "/" + name + ".csr -CA " + dir + "/ca.pem -CAkey " + dir +
+                  "/ca.key -CAcreateserial -days 2 -out " + dir + "/" + name + ".pem -extfile " + dir + "/" + name +
+                  ".ext");
+    }
+    if (!made) GTEST_SKIP() << "openssl could not make the test certificates";
+    test::ScopedEnv trustStore("SSL_CERT_FILE", dir + "/ca.pem");
+    env.config().caCertPath.clear();
+
+    test::StubPcSuite good(dir + "/good.pem", dir + "/good.key");
+    good.setDefaultAnswer({200, R"({"code":0})"});
+    Endpoints::setConnectCenterServerUrl(good.baseUrl());
+    EXPECT_TRUE(ConnectCenterRequest::getDeviceList(status, msg));
+    EXPECT_EQ(good.requestCount(), 1u);
+
+    // Signed by the trusted CA, but for another name: refused before anything is sent.
+    test::StubPcSuite other(dir + "/other.pem", dir + "/other.key");
+    other.setDefaultAnswer({200, R"({"code":0})"});
+    Endpoints::setConnectCenterServerUrl(other.baseUrl());
+    EXPECT_FALSE(ConnectCenterRequest::getDeviceList(status, msg));
+    EXPECT_EQ(other.requestCount(), 0u);
 }
 
 }  // namespace
