@@ -67,13 +67,69 @@ bool isCredentialName(const std::string& name) {
                        [&](const char* word) { return n.find(word) != std::string::npos; });
 }
 
+// A credential as the log shows it: its first and last three characters around "****", or
+// "****" alone when it is too short to keep any of it.
+std::string maskedValue(const std::string& value) {
+    if (value.empty()) return value;
+    const std::string shown = text::paramAddMask(value);
+    return shown == value ? "****" : shown;
+}
+
+// Masks, in a text that is not JSON, the value after every credential word followed by "="
+// or ":" ("token=abc", "Token: abc", "'token':'abc'"); true when anything was masked.
+bool maskCredentialPairs(std::string& text) {
+    const std::string low = lowered(text);
+    const auto isValueEnd = [](char c) {
+        return std::isspace(static_cast<unsigned char>(c)) || c == '"' || c == '\'' || c == '&' || c == ',' ||
+               c == ';' || c == '}' || c == '<';
+    };
+    std::string out;
+    std::size_t copied = 0;
+    bool masked = false;
+    // The next place of each word, searched again only once the scan has passed it, so that a
+    // long text is read about once per word.
+    std::array<std::size_t, kCredentialWords.size()> next{};
+    for (std::size_t w = 0; w < kCredentialWords.size(); ++w) next[w] = low.find(kCredentialWords[w]);
+    for (std::size_t pos = 0; pos < low.size();) {
+        std::size_t hit = std::string::npos;
+        std::size_t wordLength = 0;
+        for (std::size_t w = 0; w < kCredentialWords.size(); ++w) {
+            if (next[w] != std::string::npos && next[w] < pos) next[w] = low.find(kCredentialWords[w], pos);
+            if (next[w] < hit) {
+                hit = next[w];
+                wordLength = std::char_traits<char>::length(kCredentialWords[w]);
+            }
+        }
+        if (hit == std::string::npos) break;
+        std::size_t i = hit + wordLength;
+        while (i < low.size() && (std::isalnum(static_cast<unsigned char>(low[i])) || low[i] == '_')) ++i;
+        while (i < low.size() && (low[i] == '"' || low[i] == '\'' || low[i] == ' ')) ++i;
+        if (i < low.size() && (low[i] == '=' || low[i] == ':')) {
+            ++i;
+            while (i < low.size() && (low[i] == ' ' || low[i] == '"' || low[i] == '\'')) ++i;
+            std::size_t end = i;
+            while (end < low.size() && !isValueEnd(text[end])) ++end;
+            if (end > i) {
+                out.append(text, copied, i - copied);
+                out += maskedValue(text.substr(i, end - i));
+                copied = end;
+                masked = true;
+            }
+            i = end;
+        }
+        pos = std::max(i, hit + 1);
+    }
+    if (masked) text = out + text.substr(copied);
+    return masked;
+}
+
 // Masks credential members in place; true when anything was masked.
 bool maskCredentials(Json& j) {
     bool masked = false;
     if (j.is_object()) {
         for (auto it = j.begin(); it != j.end(); ++it) {
             if (isCredentialName(it.key()) && it->is_string()) {
-                *it = text::paramAddMask(it->get<std::string>());
+                *it = maskedValue(it->get<std::string>());
                 masked = true;
             } else if (isCredentialName(it.key()) && !it->is_null() && !it->is_object() && !it->is_array()) {
                 *it = "****";
@@ -242,7 +298,10 @@ std::string RequestBase::maskForLog(const std::string& text) {
             return maskCredentials(*parsed) ? text.substr(0, start) + json::compact(*parsed) : text;
         }
     }
-    return text;
+    // Not JSON (an error page, a form body): "name=value" and "name: value" pairs.
+    std::string shown = text;
+    maskCredentialPairs(shown);
+    return shown;
 }
 
 }  // namespace kesu

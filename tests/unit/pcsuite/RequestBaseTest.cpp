@@ -132,6 +132,11 @@ TEST(RequestBaseMask, CredentialsAreMaskedForTheLog) {
     EXPECT_EQ(RequestBase::maskForLog(R"(40#{"event":"x","token":"abcdefghijklmnop"})").find("abcdefghijklmnop"),
               std::string::npos);
     EXPECT_EQ(RequestBase::maskForLog(R"({ "b":1, "a":2 })"), R"({ "b":1, "a":2 })");
+    // A short credential is hidden whole; in a text that is not JSON, "name=value" and
+    // "name: value" pairs are masked and the rest stays.
+    EXPECT_EQ(RequestBase::maskForLog(R"({"token":"abc12"})"), R"({"token":"****"})");
+    EXPECT_EQ(RequestBase::maskForLog("denied token=abcdefghijklmnop&x=1, Password: \"s3cr3t\" end"),
+              "denied token=abc****nop&x=1, Password: \"****\" end");
 }
 
 // https against a server whose certificate comes from a CA made for the test.
