@@ -10,6 +10,7 @@
 #include <asio/posix/stream_descriptor.hpp>
 #include <asio/steady_timer.hpp>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstring>
@@ -69,6 +70,8 @@ struct FileMonitor::Watch : std::enable_shared_from_this<Watch> {
         arm();
         read();
     }
+    // Whether change notification is in place (a watch on the folder or an ancestor).
+    bool watching() const { return !closed && descriptor.is_open() && wd >= 0; }
     void close() {
         closed = true;
         settle.cancel();
@@ -155,6 +158,7 @@ struct FileMonitor::Passes {
     std::condition_variable ended;
     bool underWay = false;
     bool again = false;  // a check was asked for while one was under way
+    bool retrySoon = false;  // the last read left the file to look at again shortly
     bool stopped = false;
 };
 
@@ -164,8 +168,18 @@ FileMonitor::FileMonitor(EventLoop& loop, std::string databaseFilePath)
       pushClientPort_(Config::current().pushClientUdpPort),
       lastModifyTime(WallClock::now()),
       passes_(std::make_shared<Passes>()),
-      timer_(std::make_shared<PeriodicTimer>(loop.context(), [] { return Config::current().fileMonitorPeriod; },
-                                             [this] { tick(); })) {}
+      timer_(std::make_shared<PeriodicTimer>(loop.context(), [this] { return period(); }, [this] { tick(); })) {}
+
+std::chrono::milliseconds FileMonitor::period() const {
+    const Config& config = Config::current();
+    // A lock held by a writer, or a file we may not examine yet, ends without a change to
+    // report: those are looked at again every short period.
+    const auto current = state();
+    const bool quiet = current != DatabaseState::Busy && current != DatabaseState::Unreadable;
+    if (watch_ && watch_->watching() && quiet)
+        return std::max(config.fileMonitorPeriod, config.fileMonitorWatchedPeriod);
+    return config.fileMonitorPeriod;
+}
 
 FileMonitor::~FileMonitor() { stop(); }
 
@@ -249,18 +263,27 @@ void FileMonitor::tick() {
                 // One bad pass must not end the watch.
                 Log::mPrintlog(std::string("[fileMonitorStart] pass failed: ") + e.what());
             }
+            const auto after = state();
             std::lock_guard<std::mutex> lock(passes->mutex);
+            passes->retrySoon = after == DatabaseState::Busy || after == DatabaseState::Unreadable;
             passes->underWay = false;
             passes->ended.notify_all();
         },
         [passes, timer] {
-            bool again = false;
+            bool again = false, retrySoon = false;
             {
                 std::lock_guard<std::mutex> lock(passes->mutex);
                 again = std::exchange(passes->again, false) && !passes->stopped;
+                retrySoon = passes->retrySoon && !passes->stopped;
             }
-            if (again)
-                if (auto t = timer.lock()) t->runNow();
+            auto t = timer.lock();
+            if (!t) return;
+            if (again) {
+                t->runNow();
+            } else if (retrySoon) {
+                // The wait was chosen before this read found the file locked: make it short.
+                t->start(Config::current().fileMonitorPeriod);
+            }
         });
 }
 

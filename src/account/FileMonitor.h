@@ -4,9 +4,10 @@
 // publishes "AccountChangeEvent". The file's state (missing, unreadable, busy, good) is
 // logged once per change of state, not on every pass; a read that found the file locked is
 // tried again on the next pass until it gets through.
-// The pass runs every period on the event loop's timer and at once (after a short settling
-// delay) when inotify reports a change in the database's folder, or in its nearest existing
-// ancestor while the folder does not exist yet. The file's identity is taken on the loop; a
+// The pass runs at once (after a short settling delay) when inotify reports a change in the
+// database's folder, or in its nearest existing ancestor while the folder does not exist yet;
+// and on the event loop's timer as a safety net: every fileMonitorWatchedPeriod while inotify
+// watches, every fileMonitorPeriod without it or while a read waits for a writer's lock. The file's identity is taken on the loop; a
 // read of the database (which may wait for a writer's lock) runs on the loop's worker pool,
 // one at a time.
 #pragma once
@@ -83,6 +84,9 @@ private:
     Read inspect();
     // The second half, which may wait for the database's lock.
     void readFile(Read read);
+    // Loop: the wait before the next pass: long while inotify watches the folder and the
+    // last pass left nothing to retry, else Config::fileMonitorPeriod.
+    std::chrono::milliseconds period() const;
     // Loop: inspects the file and reads it on the pool unless a read is under way (then one
     // more pass follows it).
     void tick();

@@ -95,11 +95,10 @@ asio::awaitable<void> LaunchService::launchService(std::string ip, std::string l
     co_await loop_.runBlocking(std::move(sendBuryPoint));
 
     // The sharing application has no window: nothing to wait for.
-    auto showWindow = [this, appSource, &request] {
-        return startAllowedWindow(appSource, request.deviceName, request.deviceId, request.account, request.openId,
-                                  request.deviceType);
-    };
-    const int exitCode = !forPcsuite ? 0 : co_await loop_.runBlocking(std::move(showWindow));
+    const int exitCode = !forPcsuite ? 0
+                                     : co_await startAllowedWindow(appSource, request.deviceName, request.deviceId,
+                                                                   request.account, request.openId,
+                                                                   request.deviceType);
     Log::mPrintlog("[launchService] startAllowedWindow exitCode is " + std::to_string(exitCode));
     if (exitCode != 0) Log::mPrintlog("[launchService] reject for exitCode " + std::to_string(exitCode));
 
@@ -145,39 +144,42 @@ asio::awaitable<void> LaunchService::launchService(std::string ip, std::string l
         "[launchService] waiting for pcsuite/kesushare connecting websocket result by [reportNFCConnectResult] \n");
 }
 
-int LaunchService::startAllowedWindow(AppSource appSource, const std::string& deviceName, const std::string& deviceId,
-                                      const std::string& account, const std::string& openId,
-                                      const std::string& deviceType) {
-    if (appSource == AppSource::kesuShare) return 0;
+asio::awaitable<int> LaunchService::startAllowedWindow(AppSource appSource, std::string deviceName,
+                                                      std::string deviceId, std::string account, std::string openId,
+                                                      std::string deviceType) {
+    if (appSource == AppSource::kesuShare) co_return 0;
     const Config& config = Config::current();
     const std::string path = rootedPath(config.connectStatusExecutable);
     const auto arguments = allowWindowArguments(appSource, deviceName, deviceId, account,
                                                 sameAccountFlag(openId, accountOpenId()), deviceType);
+    const auto timeout = config.allowWindowTimeout;
 
     // Answers left over from an earlier window do not count for this one.
-    while (hAllowSemaphore().try_acquire()) {
-    }
+    allowWindowAnswers().drain();
     {
         std::lock_guard<std::mutex> lock(waitMutex_);
-        if (stopped_) return -1;
-        ++waiting_;  // from here on stopWaits() ends this wait
+        if (stopped_) co_return -1;
     }
     Log::mPrintlog("[startAllowedWindow] launchPath is: " + path + ", arguments is: " + describeList(arguments) +
                      " \n");
-    int exitCode = 0;
-    const bool started = process::startProcess(path, arguments, exitCode);
-    Log::mPrintlog("[startAllowedWindow] exitCode is: " + std::to_string(exitCode) + "\n");
-    if (!started) {
-        std::lock_guard<std::mutex> lock(waitMutex_);
-        --waiting_;
-        return -1;
-    }
+    struct Launch {
+        bool started = false;
+        int exitCode = 0;
+    };
+    auto launch = [&path, &arguments] {
+        Launch result;
+        result.started = process::startProcess(path, arguments, result.exitCode);
+        return result;
+    };
+    const Launch launched = co_await loop_.runBlocking(std::move(launch));
+    Log::mPrintlog("[startAllowedWindow] exitCode is: " + std::to_string(launched.exitCode) + "\n");
+    if (!launched.started) co_return -1;
     Log::mPrintlog("[startAllowedWindow] Enter the allow window event waiting! \n");
-    const bool answered = hAllowSemaphore().try_acquire_for(config.allowWindowTimeout);
+    // On the loop: the answer (or stopWaits) wakes this coroutine; no thread waits for it.
+    const bool answered = co_await allowWindowAnswers().wait(timeout);
     bool stopped = false;
     {
         std::lock_guard<std::mutex> lock(waitMutex_);
-        --waiting_;
         stopped = stopped_;
     }
     Log::mPrintlog(answered ? "[startAllowedWindow]allow window event success \n"
@@ -186,10 +188,10 @@ int LaunchService::startAllowedWindow(AppSource appSource, const std::string& de
 
     if (!stopped && ConnectionState::getIsAllowWindow()) {
         Log::mPrintlog("[startAllowedWindow] you have agree the allowed window! \n");
-        return 0;
+        co_return 0;
     }
     Log::mPrintlog("[startAllowedWindow] you have refuse the allowed window! \n");
-    return -1;
+    co_return -1;
 }
 
 bool LaunchService::sendPhoneInfoToPcsuite(const std::string& localIp, const std::string& ip,
@@ -261,12 +263,13 @@ bool LaunchService::startKesuShareAllowedWindow(const std::string& deviceName, c
 void LaunchService::stopWaits() {
     std::lock_guard<std::mutex> lock(waitMutex_);
     stopped_ = true;
-    if (waiting_ > 0) hAllowSemaphore().release(waiting_);
+    allowWindowAnswers().close();
 }
 
 void LaunchService::resume() {
     std::lock_guard<std::mutex> lock(waitMutex_);
     stopped_ = false;
+    allowWindowAnswers().reopen();
 }
 
 }  // namespace kesu

@@ -2,8 +2,8 @@
 // allow window and the user's answer, the answer to the phone, and the hand-over to the PC
 // suite (an HTTP message, or starting the PC suite with the phone's details) or to the
 // sharing application's window. The hand-over is a coroutine on the event loop; what blocks
-// (HTTP to the PC suite, program launches, the wait for the user's answer) runs on the loop's
-// worker pool.
+// (HTTP to the PC suite, program launches) runs on the loop's worker pool, and the wait for
+// the user's answer is a wake-up on the loop.
 #pragma once
 
 #include <asio/awaitable.hpp>
@@ -29,16 +29,17 @@ public:
     explicit LaunchService(EventLoop& loop) : loop_(loop) {}
 
     // The whole hand-over of one request from the phone at `ip`, received on the PC's
-    // address `localIp`, on the loop. Waits (off the loop) for the allow window
-    // (Config::allowWindowTimeout) and the exchanges with the PC suite.
+    // address `localIp`, on the loop. Waits for the allow window (Config::allowWindowTimeout)
+    // and (off the loop) for the exchanges with the PC suite.
     asio::awaitable<void> launchService(std::string ip, std::string localIp, AppSource appSource,
                                         PhoneConnectRequest request, SendTcp sendTcp);
 
-    // Blocking (worker pool): shows the PC suite's allow window and waits for the user's answer: 0 when agreed, -1
-    // when refused, unanswered in time or the window could not be started. The sharing
-    // application has no such window: 0 at once.
-    int startAllowedWindow(AppSource appSource, const std::string& deviceName, const std::string& deviceId,
-                           const std::string& account, const std::string& openId, const std::string& deviceType);
+    // On the loop: shows the PC suite's allow window (the launch runs on the worker pool) and
+    // waits for the user's answer, at most Config::allowWindowTimeout, holding no thread: 0
+    // when agreed, -1 when refused, unanswered in time or the window could not be started.
+    // The sharing application has no such window: 0 at once.
+    asio::awaitable<int> startAllowedWindow(AppSource appSource, std::string deviceName, std::string deviceId,
+                                            std::string account, std::string openId, std::string deviceType);
 
     // Posts {"event": "nfcConection", "args": [nine texts]} to the PC suite's listener on the
     // PC's address `localIp`; true when it answered.
@@ -86,7 +87,6 @@ private:
     std::string previousFolder_;
 
     std::mutex waitMutex_;
-    int waiting_ = 0;       // threads waiting for an allow-window answer
     bool stopped_ = false;  // stopWaits() was called
 };
 

@@ -89,7 +89,7 @@ std::string allowWindowAnswer(const requestObj& request, bool agree) {
     const Json& params = positional(request);
     if (agree && !params.empty()) ConnectionState::setThisPhoneAutoConnect(paramText(params, 0) == "true");
     ConnectionState::setIsAllowWindow(agree);
-    hAllowSemaphore().release();
+    allowWindowAnswers().signal();
     const Json record = {{"type", 1}, {"eventId", "W688|10160"}, {"params", {{"click", 1}}}};
     const std::string buryPointStr = "[" + pretty(record) + "]";
     Log::mPrintlog("[launchService] sendBuryPoint buryPointStr is: " + buryPointStr + " \n");

@@ -64,15 +64,18 @@ struct Config {
     // How long preconnect_startScan waits for the cloud device list to fill the registry.
     std::chrono::milliseconds preconnectScanWait{5000};
 
-    // Screen-lock watcher period.
+    // Screen-lock watcher period, and the longer one used while the machine cannot tell
+    // whether the screen is locked (no login manager or no user session).
     std::chrono::milliseconds screenLockPeriod{3000};
+    std::chrono::milliseconds screenLockUnknownPeriod{60000};
 
     // Device-list reports to the PC suite: the pause after a change (a burst of changes goes
     // as one list), the least time between two lists of one kind, and the period of the
-    // sweep that drops discovered devices not heard for ssdpDeviceExpiry.
+    // sweep that drops discovered devices not heard for ssdpDeviceExpiry: it runs only while
+    // the table holds devices, at the next device's expiry, and at least once per period.
     std::chrono::milliseconds reportDelay{1000};
     std::chrono::milliseconds reportThrottle{3000};
-    std::chrono::milliseconds expirySweepPeriod{3000};
+    std::chrono::milliseconds expirySweepPeriod{30000};
 
     // Watchdog of the control server.
     std::chrono::milliseconds httpWatchdogPeriod{120000};
@@ -103,7 +106,10 @@ struct Config {
 
     // PC suite's account database: the monitor's modification-time poll, and how long one
     // read waits for the PC suite's write lock before it gives up (the old values stay).
+    // While change notification watches the folder, the poll is only a safety net and runs
+    // every fileMonitorWatchedPeriod instead.
     std::chrono::milliseconds fileMonitorPeriod{3000};
+    std::chrono::milliseconds fileMonitorWatchedPeriod{60000};
     std::chrono::milliseconds databaseBusyTimeout{1000};
 
     std::string defaultConnectCenterUrl = "https://connect-center.kesu.example/";

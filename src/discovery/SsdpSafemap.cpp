@@ -108,6 +108,12 @@ bool SsdpSafemap::eraseTimeOut() {
     return !erased.empty();
 }
 
+std::optional<SteadyClock::time_point> SsdpSafemap::nextExpiry() const {
+    std::lock_guard<std::mutex> guard(lock);
+    if (byAge_.empty()) return std::nullopt;
+    return byAge_.begin()->first + expiry_;
+}
+
 void SsdpSafemap::clear() {
     std::lock_guard<std::mutex> guard(lock);
     safeMap.clear();

@@ -8,6 +8,7 @@
 #include <cstddef>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <set>
 #include <string>
 #include <utility>
@@ -38,6 +39,9 @@ public:
     // Removes every entry not heard for longer than the expiry (an entry exactly at the
     // expiry stays); true when at least one went.
     bool eraseTimeOut();
+    // When the entry heard longest ago passes the expiry (the next sweep that removes
+    // something); nullopt for an empty table.
+    std::optional<SteadyClock::time_point> nextExpiry() const;
     // Removes every entry.
     void clear();
 

@@ -1,11 +1,10 @@
 // The screen-lock watcher: publishes LogOut when the screen gets locked and LogOn when it
 // gets unlocked, checking every few seconds (a timer on the loop; the check itself launches
-// a program, so it runs on the worker pool).
+// a program, so it runs on the worker pool). While the machine cannot tell (no login manager,
+// no user session) the check runs only about once a minute, and the screen counts as unlocked.
 #pragma once
 
 #include <memory>
-
-#include "core/PeriodicTimer.h"
 
 namespace kesu {
 
@@ -25,7 +24,6 @@ private:
 
     EventLoop& loop_;
     std::shared_ptr<State> state_;
-    PeriodicTimer timer_;
 };
 
 }  // namespace kesu

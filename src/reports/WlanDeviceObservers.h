@@ -9,8 +9,6 @@
 #include <mutex>
 #include <vector>
 
-#include "core/PeriodicTimer.h"
-
 namespace kesu {
 
 class EventLoop;
@@ -64,15 +62,20 @@ public:
     WlanDeviceDelete& operator=(const WlanDeviceDelete&) = delete;
 
     // Starts the sweep, a timer on the loop: sweep now, notifySubscribers() when something
-    // was removed, again every `period`; until stop(). A second call does nothing.
+    // was removed, again when the next device expires, at most `period` later; until stop().
+    // An empty table is not swept: the next device heard arms the timer again. A second call
+    // does nothing.
     void detectedToDelete(std::chrono::milliseconds period);
     // No sweep runs after this returns.
     void stop();
 
 private:
+    struct Sweep;
+
     EventLoop& loop_;
     SsdpDeviceManager& manager_;
-    std::unique_ptr<PeriodicTimer> timer_;
+    std::shared_ptr<Sweep> sweep_;
+    std::size_t hookToken_ = 0;
 };
 
 }  // namespace kesu

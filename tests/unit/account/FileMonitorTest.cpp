@@ -336,6 +336,37 @@ TEST_F(FileMonitorTest, ChangesAreSeenWithoutWaitingForThePeriod) {
     EXPECT_FALSE(monitor.running());
 }
 
+// While inotify watches, the periodic pass is rare; a read that found the file locked must
+// still be tried again every short period, since the lock going changes nothing in the file.
+TEST_F(FileMonitorTest, LockedReadIsRetriedSoonWhileTheWatchMakesThePassRare) {
+    env.config().databaseBusyTimeout = 20ms;
+    env.config().fileMonitorPeriod = 20ms;
+    env.config().fileMonitorWatchedPeriod = std::chrono::hours(1);
+    writeDatabase(dbFile(), kSignedInRows);
+    FileMonitor monitor(loop, dbDir());
+    ASSERT_TRUE(monitor.start());
+    ASSERT_EQ(dataInstance().get().openid, "oid-1");
+    const int started = changes();
+
+    sqlite3* writer = nullptr;
+    ASSERT_EQ(sqlite3_open(dbFile().c_str(), &writer), SQLITE_OK);
+    ASSERT_EQ(sqlite3_exec(writer,
+                           "BEGIN EXCLUSIVE;"
+                           "UPDATE User SET openid = 'oid-2', token = 'tok-2';"
+                           "UPDATE SoftwareSet SET openid = 'oid-2' WHERE openid = 'oid-1';"
+                           "COMMIT; BEGIN EXCLUSIVE;",
+                           nullptr, nullptr, nullptr),
+              SQLITE_OK);
+    // The change is noticed but cannot be read yet.
+    ASSERT_TRUE(events->waitFor("AccountChangeEvent", started + 1, 10s));
+    EXPECT_EQ(dataInstance().get().openid, "oid-1");
+    ASSERT_EQ(sqlite3_exec(writer, "ROLLBACK;", nullptr, nullptr, nullptr), SQLITE_OK);
+    sqlite3_close(writer);
+    ASSERT_TRUE(events->waitFor("AccountChangeEvent", started + 2, 10s));
+    EXPECT_EQ(dataInstance().get().openid, "oid-2");
+    monitor.stop();
+}
+
 TEST_F(FileMonitorTest, ServiceStartReadsWithoutWaitingAPeriodAndFillsTheDeviceId) {
     // A period far beyond the test's limits: the first read must not wait for it, and
     // stopping must not either.

@@ -7,7 +7,9 @@
 
 #include <gtest/gtest.h>
 
+#include <condition_variable>
 #include <future>
+#include <mutex>
 
 #include "connect/AllowWindow.h"
 #include "phonesim/PhoneSimulator.h"
@@ -26,10 +28,7 @@ using Phone = phonesim::Link;
 constexpr auto kLong = 120s;
 constexpr auto kWait = 60s;  // how long a test phone waits for an answer
 
-void drainAllowAnswers() {
-    while (hAllowSemaphore().try_acquire()) {
-    }
-}
+void drainAllowAnswers() { allowWindowAnswers().drain(); }
 
 class PhoneServer : public test::PcIdentityTest {
 protected:
@@ -155,6 +154,42 @@ TEST_F(PhoneServer, OtherPhonesAreBusyWhileOneIsHandled) {
     ASSERT_TRUE(handOver);
     const Json message = Json::parse(handOver->body.substr(handOver->body.find('#') + 1));
     EXPECT_EQ(message["args"][4], "0");
+}
+
+// The wait for the user's answer holds no worker: both pool workers meet while a window is
+// open. Unanswered, the window ends at its time-out as a refusal, and an answer that comes
+// too late does not agree to the next window.
+TEST_F(PhoneServer, AllowWindowWaitHoldsNoWorkerAndEndsAtItsTimeOut) {
+    auto first = send(request("com.kesu.pcsuite.SERVICE", 0));
+    ASSERT_TRUE(window->next(kLong));
+    std::mutex m;
+    std::condition_variable cv;
+    int arrived = 0;
+    auto meet = [&] {
+        std::unique_lock<std::mutex> lock(m);
+        ++arrived;
+        cv.notify_all();
+        return cv.wait_for(lock, 10s, [&] { return arrived == 2; });
+    };
+    std::promise<bool> a, b;
+    loop.offload([&] { a.set_value(meet()); });
+    loop.offload([&] { b.set_value(meet()); });
+    EXPECT_TRUE(a.get_future().get());
+    EXPECT_TRUE(b.get_future().get());
+    EXPECT_EQ(control("QtAgree", {"false"})["error"], 0);
+    EXPECT_EQ(answer(*first)["bytes"], Json::array({3}));
+    ASSERT_TRUE(server.waitForNoLinks(kLong));
+
+    env.config().allowWindowTimeout = 200ms;
+    for (int round = 0; round < 2; ++round) {
+        auto phone = send(request("com.kesu.pcsuite.SERVICE", 0));
+        ASSERT_TRUE(window->next(kLong));
+        EXPECT_EQ(answer(*phone)["bytes"], Json::array({4}));
+        ASSERT_TRUE(server.waitForNoLinks(kLong));
+        EXPECT_EQ(control("QtAgree", {"false"})["error"], 0);  // too late
+    }
+    EXPECT_NE(test::todaysLog().find("[startAllowedWindow]allow window event timedOut"), std::string::npos);
+    EXPECT_EQ(pcsuite.requestsTo("/").size(), 1u);  // only the agreed phone was handed over
 }
 
 TEST_F(PhoneServer, BusyPcSuiteAnswersByDeviceType) {

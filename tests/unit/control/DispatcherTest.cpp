@@ -129,20 +129,20 @@ TEST_F(Dispatch, AccountChangeSignInAndSignOut) {
 
 TEST_F(Dispatch, AllowWindowAnswersReleaseTheWaiterOnceEach) {
     EXPECT_EQ(control("QtAgree", {"true"}), em(0, "Close"));
-    EXPECT_TRUE(hAllowSemaphore().try_acquire_for(1s));
+    EXPECT_TRUE(allowWindowAnswers().take());
     EXPECT_TRUE(ConnectionState::getIsAllowWindow());
     EXPECT_TRUE(ConnectionState::getThisPhoneAutoConnect());
     EXPECT_EQ(control("QtAgree", {"false"}), em(0, "Close"));
-    EXPECT_TRUE(hAllowSemaphore().try_acquire_for(1s));
+    EXPECT_TRUE(allowWindowAnswers().take());
     EXPECT_FALSE(ConnectionState::getThisPhoneAutoConnect());
     ConnectionState::setThisPhoneAutoConnect(true);
     EXPECT_EQ(control("QtAgree"), em(0, "Close"));  // no parameters: unchanged
-    EXPECT_TRUE(hAllowSemaphore().try_acquire_for(1s));
+    EXPECT_TRUE(allowWindowAnswers().take());
     EXPECT_TRUE(ConnectionState::getThisPhoneAutoConnect());
     EXPECT_EQ(control("QtRefuse"), em(0, "Refuse"));
-    EXPECT_TRUE(hAllowSemaphore().try_acquire_for(1s));
+    EXPECT_TRUE(allowWindowAnswers().take());
     EXPECT_FALSE(ConnectionState::getIsAllowWindow());
-    EXPECT_FALSE(hAllowSemaphore().try_acquire());  // exactly one signal per answer
+    EXPECT_FALSE(allowWindowAnswers().take());  // exactly one signal per answer
 
     const auto bury = pcsuite.requestsTo("/buryPoint");
     ASSERT_EQ(bury.size(), 4u);

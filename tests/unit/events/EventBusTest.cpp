@@ -101,12 +101,18 @@ TEST_F(EventBus, ScreenLockWatcherPublishesLogOutThenLogOn) {
     env.config().screenLockPeriod = 20ms;
     auto events = std::make_shared<test::EventRecorder>();
     EventPublisher::instance().addObserver(events);
+    env.config().screenLockUnknownPeriod = 1h;
+    fake->setScreenLocked(true);
     {
         EventDetected watcher(loop);
-        fake->setScreenLocked(true);
         ASSERT_TRUE(events->waitFor("LogOutEvent", 1, 10s));
         fake->setScreenLocked(std::nullopt);  // unknown counts as unlocked
         ASSERT_TRUE(events->waitFor("LogOnEvent", 1, 10s));
+        // While the machine cannot tell, the check waits for the long period.
+        const int calls = fake->screenLockedCalls();
+        fake->setScreenLocked(true);
+        EXPECT_FALSE(events->waitFor("LogOutEvent", 2, 300ms));
+        EXPECT_EQ(fake->screenLockedCalls(), calls);
     }
     EXPECT_EQ(events->events(), (Names{"LogOutEvent", "LogOnEvent"}));
 }

@@ -281,6 +281,24 @@ TEST_F(DeviceReportsTest, ReannouncedDeviceIsReportedOnceThenOnceMoreWhenItExpir
     EXPECT_EQ(table.ssdpDeviceMap.size(), 1u);
 }
 
+// The sweep sleeps while the table is empty and wakes at the next expiry, not on its period:
+// each device heard into an empty table is still removed, and the removal reported.
+TEST_F(DeviceReportsTest, SweepWakesForTheNextExpiryOfAFreshlyFilledTable) {
+    SsdpDeviceManager live{64, 0.2};  // the real clock
+    WlanDeviceDelete expiry(loop, live);
+    auto reporter = std::make_shared<WlanReportDevices>(live);
+    reporter->start(loop);
+    expiry.addObserver(reporter);
+    expiry.detectedToDelete(1h);
+    for (const std::string id : {"aaaa", "bbbb"}) {
+        const std::size_t before = pcsuite.requestsTo(kLanPath).size();
+        SsdpMessage::insertResponseDevice(json::compact(phoneBody(id)), "10.0.0.1", "openid-of-this-pc", true, live);
+        ASSERT_TRUE(reports(before + 1, 10s)) << seen(pcsuite);
+        EXPECT_EQ(pcsuite.requestsTo(kLanPath).back().body, "[]");
+        EXPECT_EQ(live.ssdpDeviceMap.size(), 0u);
+    }
+}
+
 // The service manager's wiring: a first LAN list at start, one per new device heard through
 // the process-wide table, one on the control request startSSDPScan, none after stop().
 TEST_F(DeviceReportsTest, ServiceStartWiresTheLanReports) {
