@@ -59,7 +59,15 @@ void EventLoop::nameWorker() {
 
 std::shared_ptr<asio::thread_pool> EventLoop::pool() {
     std::lock_guard<std::mutex> lock(poolMutex_);
-    if (!pool_) pool_ = std::make_shared<asio::thread_pool>(workers_);
+    if (!pool_) {
+        // A new thread starts with its creator's name: the pool's threads are named from the
+        // start, not only once they first run work.
+        char creatorName[16] = {};
+        pthread_getname_np(pthread_self(), creatorName, sizeof creatorName);
+        pthread_setname_np(pthread_self(), "kesu-pool");
+        pool_ = std::make_shared<asio::thread_pool>(workers_);
+        pthread_setname_np(pthread_self(), creatorName);
+    }
     return pool_;
 }
 

@@ -222,7 +222,9 @@ TEST(ServiceE2E, SurvivesHostileBodies) {
     const long before = rssKiB(service->pid());
     junkRound(rounds);
     const long after = rssKiB(service->pid());
-    if (kMeasureMemory) EXPECT_LT(after - before, 8 * 1024) << before << " KiB -> " << after << " KiB";
+    if (kMeasureMemory) {
+        EXPECT_LT(after - before, 8 * 1024) << before << " KiB -> " << after << " KiB";
+    }
     EXPECT_TRUE(isAlive(heartbeat()));
     EXPECT_TRUE(service->running());
 }
