@@ -27,6 +27,8 @@ struct Config {
     std::string pcsuiteHost = "127.0.0.1";
     int pcsuitePort = 9199;
     int pushClientUdpPort = 13601;
+    // The local telemetry collector (datagrams to 127.0.0.1).
+    int telemetryUdpPort = 9997;
 
     // Phone-side TCP port (both directions) and LAN discovery.
     int phoneTcpPort = 10191;

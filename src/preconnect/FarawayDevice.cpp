@@ -132,7 +132,6 @@ void FarawayDevice::updateFrom(const FarawayDevice& other) {
     Info fresh = other.info();
     std::lock_guard<std::mutex> lock(mutex_);
     fresh.wlanClientIp = std::move(info_.wlanClientIp);
-    fresh.reportTime = std::move(info_.reportTime);
     info_ = std::move(fresh);
 }
 

@@ -71,7 +71,9 @@ public:
     void setAllInfo(const Json& j);
     Json getLocalInfo() const;
     Info info() const;
-    // Takes the cloud's fields of `other`; wlanClientIp, reportTime and the link stay.
+    // Takes the cloud's fields of `other` (its report time included: a newer report must
+    // count as newer once only, and the candidates are ranked by it); wlanClientIp and the
+    // link stay.
     void updateFrom(const FarawayDevice& other);
     // Changes the data in place (tests and the registry's merge).
     template <class F>
