@@ -72,6 +72,10 @@ struct Config {
     // preconnectMaxPendingRequests requests of the phone wait for their answer. TCP keep-alive
     // on held links: first probe after the idle time, then every interval, given up after
     // the count.
+    // The scheduler tries one device per period; a user's request to pre-connect one device
+    // waits for the outcome up to preconnectUserWait.
+    std::chrono::milliseconds preconnectPeriod{1000};
+    std::chrono::milliseconds preconnectUserWait{60000};
     std::chrono::milliseconds preconnectConnectTimeout{3000};
     std::chrono::milliseconds preconnectHandshakeTimeout{3000};
     std::size_t preconnectQueueMaxFrames = 64;

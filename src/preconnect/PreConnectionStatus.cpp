@@ -45,6 +45,13 @@ void ReportPreconnectResult::removeReceiptMessageObserver(const std::string& dev
     m_observer_.erase(deviceId);
 }
 
+void ReportPreconnectResult::removeReceiptMessageObserver(const std::string& deviceId,
+                                                          const std::shared_ptr<PreconnectObserver>& observer) {
+    std::lock_guard<std::mutex> lock(observersLock_);
+    auto it = m_observer_.find(deviceId);
+    if (it != m_observer_.end() && it->second == observer) m_observer_.erase(it);
+}
+
 bool ReportPreconnectResult::notify(const std::string& deviceId, const std::string& data) {
     std::lock_guard<std::mutex> lock(observersLock_);
     auto it = m_observer_.find(deviceId);

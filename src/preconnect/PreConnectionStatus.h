@@ -43,6 +43,8 @@ public:
     // One waiter per device: a second registration replaces the first.
     void addReceiptMessageObserver(const std::string& deviceId, std::shared_ptr<PreconnectObserver> observer);
     void removeReceiptMessageObserver(const std::string& deviceId);
+    // Removes `observer` only while it is still the device's waiter (not one that replaced it).
+    void removeReceiptMessageObserver(const std::string& deviceId, const std::shared_ptr<PreconnectObserver>& observer);
     // Hands `data` to the waiter of the device, if there is one.
     bool notify(const std::string& deviceId, const std::string& data);
 
