@@ -4,6 +4,7 @@
 
 #include <thread>
 
+#include "preconnect/PreConnectEventSubscriber.h"
 #include "preconnect/PreConnectionThread.h"
 #include "support/UdpCatcher.h"
 
@@ -126,6 +127,32 @@ TEST_F(SchedulerTest, UserRequestFailsAfterTwoFailedAttempts) {
     EXPECT_GE(entry->getPreconnectTryNumber(), CONN_MAX);  // an attempt before the pick may add one
     EXPECT_EQ(entry->getConnectType(), "");
     EXPECT_EQ(entry->getFarawayDevice()->getCommunicationChannel(), nullptr);
+}
+
+TEST_F(SchedulerTest, PcEventsAdjustEveryEntry) {
+    DeviceWaitForPreConnectManager registry(&loop);
+    PreConnectEventSubscriber subscriber(loop, registry);
+    phonesim::Listener phone(phoneOptions());
+    env.config().phoneTcpPort = phone.port();
+    const auto held = add(registry, loop, "SIMP", "2026-12-06 10:00:00.000", 0);
+    held->setConnectType(FarawayDevice::kWlan);
+    ASSERT_EQ(handshake(held), true);
+    const auto failed = add(registry, loop, "AAAA", "2026-12-06 10:00:00.000", 2);
+
+    subscriber.eventNotify(ServiceEvent::Pcsuite);
+    EXPECT_EQ(failed->getFarawayWlanConnectCount(), 1);
+    subscriber.eventNotify(ServiceEvent::WifiOpen);
+    EXPECT_EQ(failed->getFarawayWlanConnectCount(), 0);
+    subscriber.eventNotify(ServiceEvent::NetworkChange);  // held links end
+    EXPECT_TRUE(phone.pcClosed(5s));
+    held->setFirstConnect(false);
+    subscriber.eventNotify(ServiceEvent::AccountChange);  // still signed in
+    EXPECT_TRUE(held->getFirstConnect());
+    EXPECT_EQ(registry.getDevicesSize(), 2);
+    dataInstance().set(&databaseParam::openid, "");
+    subscriber.eventNotify(ServiceEvent::AccountChange);  // signed out
+    EXPECT_EQ(registry.getDevicesSize(), 0);
+    EXPECT_FALSE(held->getIsConnected());
 }
 
 TEST(ReportPreconnectResultTest, OneWaiterPerDeviceAndOnlyItsOwnRemoval) {
