@@ -95,10 +95,8 @@ private:
 
     EventLoop& loop_;
     const std::string id_;
-    bool isNearByDiscovered_ = false;
     std::atomic<bool> isFarawayDiscovered_{false};
     std::atomic<int> farawayCount_{0};
-    bool disconnectNormal_ = true;
     std::atomic<bool> isConnected_{false};
     std::atomic<bool> isDisconnectNow_{false};
     std::atomic<bool> isOpenIdSame_{true};

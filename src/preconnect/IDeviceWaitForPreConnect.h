@@ -34,7 +34,7 @@ public:
     virtual std::string getConnectType() const { return {}; }
     virtual void setConnectType(const std::string&) {}
     // The handshake; runs on the event loop.
-    virtual asio::awaitable<bool> startPreConnect() { co_return false; }
+    virtual asio::awaitable<bool> startPreConnect();
     virtual void setFarawayDevice(std::shared_ptr<FarawayDevice>) {}
     virtual void updateFarawayDeviceInfo(const FarawayDevice&) {}
     virtual std::shared_ptr<FarawayDevice> getFarawayDevice() const { return nullptr; }

@@ -64,7 +64,13 @@ void StrategyDevicePreconnect::clearUserPicks() {
 bool StrategyDevicePreconnect::preconnectDeviceByDeviceId(const std::string& deviceId) {
     Utils::mPrintlog("[StrategyDevicePreconnect::preconnectDeviceByDeviceId] Preconnect device by user choose");
     DeviceWaitForPreConnectManager::Entry entry;
-    if (DeviceWaitForPreConnectManager::instance().lookupDevices(deviceId, entry) && entry->getIsConnected()) {
+    if (!DeviceWaitForPreConnectManager::instance().lookupDevices(deviceId, entry)) {
+        // The scheduler only picks devices of the registry: no outcome could come.
+        Utils::mPrintlog("[StrategyDevicePreconnect::preconnectDeviceByDeviceId] no device waiting for preconnect: " +
+                         deviceId);
+        return false;
+    }
+    if (entry->getIsConnected()) {
         Utils::mPrintlog("[StrategyDevicePreconnect::preconnectDeviceByDeviceId] This device is already preconnect success");
         if (entry->getConnectType() != FarawayDevice::kWlan) return true;
         Utils::mPrintlog("[StrategyDevicePreconnect::preconnectDeviceByDeviceId] Preconnect type is FARAWAYWLAN, Current "

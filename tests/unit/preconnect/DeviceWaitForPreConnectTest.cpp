@@ -11,6 +11,12 @@ using namespace std::chrono_literals;
 using test::PreconnectTest;
 using Mode = phonesim::PreconnectReply::Mode;
 
+phonesim::PreconnectReply modeReply(Mode mode) {
+    phonesim::PreconnectReply reply;
+    reply.mode = mode;
+    return reply;
+}
+
 std::string stepEntry(const StepStruct& step, Result result) {
     return sharedStep().getConnectCodeV2(step) + sharedStep().getConnectResult(step, result);
 }
@@ -142,15 +148,15 @@ TEST_F(PreconnectTest, RefusedHandshakes) {
         {"other device", otherDevice, step.OS4_WLAN_PARSER_DEVICE_INFO},
         {"blank in the kind", blank, step.OS4_WLAN_PARSER_DEVICE_INFO},
         {"wrong kind", wrongKind, step.OS4_WLAN_PARSER_DEVICE_INFO},
-        {"silent", {Mode::Silent}, step.OS4_WLAN_RECV_DEVICE_INFO},
-        {"garbage", {Mode::Garbage}, step.OS4_WLAN_RECV_DEVICE_INFO},
-        {"half frame", {Mode::HalfFrame}, step.OS4_WLAN_RECV_DEVICE_INFO},
-        {"1 MiB frame", {Mode::Huge}, step.OS4_WLAN_RECV_DEVICE_INFO},
-        {"hang-up", {Mode::HangUp}, step.OS4_WLAN_RECV_DEVICE_INFO},
+        {"silent", modeReply(Mode::Silent), step.OS4_WLAN_RECV_DEVICE_INFO},
+        {"garbage", modeReply(Mode::Garbage), step.OS4_WLAN_RECV_DEVICE_INFO},
+        {"half frame", modeReply(Mode::HalfFrame), step.OS4_WLAN_RECV_DEVICE_INFO},
+        {"1 MiB frame", modeReply(Mode::Huge), step.OS4_WLAN_RECV_DEVICE_INFO},
+        {"hang-up", modeReply(Mode::HangUp), step.OS4_WLAN_RECV_DEVICE_INFO},
     };
     // One attempt first: what lives for the whole process (the pool, the log file) is set up.
     {
-        phonesim::Listener phone(phoneOptions({Mode::HangUp}));
+        phonesim::Listener phone(phoneOptions(modeReply(Mode::HangUp)));
         EXPECT_EQ(handshake(entryFor(phone.port())), false);
     }
     loop.call([] {});
