@@ -1,6 +1,10 @@
 // The pre-connect handshake and the held link, against the simulated phone on loopback.
 #include "PreconnectFixture.h"
 
+#include <cstdio>
+#include <fstream>
+#include <sstream>
+
 #include "connect/PhoneLink.h"
 #include "connect/Step.h"
 
@@ -110,6 +114,34 @@ TEST_F(PreconnectTest, AcceptedHandshakeHoldsTheLinkAndAnswersThePhone) {
     phone.closeAll(true);
     ASSERT_TRUE(notices->waitFor(1, 5s));
     EXPECT_EQ(notices->ids(), std::vector<std::string>{entry->getDeviceId()});
+}
+
+// The kernel's keep-alive timer ("tr" 2 in /proc/net/tcp) of the PC's end of links to `port`,
+// in seconds; nullopt when there is no such link or its timer is another.
+std::optional<long> keepAliveSeconds(int port) {
+    std::ifstream table("/proc/net/tcp");
+    std::string line;
+    char remote[16];
+    std::snprintf(remote, sizeof remote, ":%04X ", port);
+    while (std::getline(table, line)) {
+        std::istringstream fields(line);
+        std::string slot, local, peer, state, queues, timer;
+        fields >> slot >> local >> peer >> state >> queues >> timer;
+        if ((peer + " ").find(remote) == std::string::npos || state != "01") continue;
+        if (timer.rfind("02:", 0) != 0) return std::nullopt;
+        return std::stol(timer.substr(3), nullptr, 16) / 100;  // jiffies as USER_HZ
+    }
+    return std::nullopt;
+}
+
+TEST_F(PreconnectTest, HeldLinkHasKeepAlive) {
+    phonesim::Listener phone(phoneOptions());
+    const auto entry = entryFor(phone.port());
+    ASSERT_EQ(handshake(entry), true);
+    const auto seconds = keepAliveSeconds(phone.port());
+    ASSERT_TRUE(seconds);
+    EXPECT_GT(*seconds, 20);
+    EXPECT_LE(*seconds, 30);
 }
 
 TEST_F(PreconnectTest, PcSuiteDownStillGivesThePhoneAnEmptyResult) {
