@@ -11,7 +11,9 @@
 #include "discovery/ServiceWorker.h"
 #include "reports/DeviceReports.h"
 #include "events/EventPublisher.h"
+#include "preconnect/DeviceWaitForPreConnectManager.h"
 #include "preconnect/PreConnectEventSubscriber.h"
+#include "preconnect/PreConnectionThread.h"
 
 namespace kesu {
 
@@ -23,9 +25,15 @@ void ServiceManager::start() {
     started_ = true;
     Log::mPrintlog("[Server Start]this is ServiceManager \n");
 
-    // LAN discovery (adapter check and announcement loop), then the pre-connection scheduler.
+    // LAN discovery (adapter check and announcement loop), then the pre-connection scheduler,
+    // whose held links run on the loop and whose list changes reach the pre-connect report.
     serviceWorker_ = std::make_unique<ServiceWorker>(loop_);
     serviceWorker_->start();
+    auto& registry = DeviceWaitForPreConnectManager::instance();
+    registry.setEventLoop(&loop_);
+    registry.setListChangedHandler([] { ReportDevicesV2::instance().notify(); });
+    preconnectScheduler_ = std::make_unique<PreConnectionThread>(loop_, registry);
+    preconnectScheduler_->run();
 
     // The server for phone-initiated connections, and the PC-initiated ones, on the loop.
     PcsuiteInterface::setLoop(&loop_);
@@ -56,6 +64,14 @@ void ServiceManager::stop() {
     started_ = false;
     if (serviceWorker_) serviceWorker_->stop();  // the network events' publisher goes first
     serviceWorker_.reset();
+    // No new pre-connection; every held link closed while the loop still runs.
+    if (preconnectScheduler_) preconnectScheduler_->stop();
+    preconnectScheduler_.reset();
+    auto& registry = DeviceWaitForPreConnectManager::instance();
+    registry.setListChangedHandler({});
+    for (const auto& entry : registry.getAllDevices()) entry->disconnectPreConnect();
+    registry.clearAllDevices();
+    registry.setEventLoop(nullptr);
     if (phoneServer_) phoneServer_->stop();
     phoneServer_.reset();
     PcsuiteInterface::setLoop(nullptr);

@@ -11,6 +11,7 @@ class EventLoop;
 class IEventSubscriber;
 class EventDetected;
 class ServiceWorker;
+class PreConnectionThread;
 class SocketServer;
 class WlanReportDevices;
 class WlanDeviceDelete;
@@ -33,6 +34,7 @@ private:
     std::vector<std::shared_ptr<IEventSubscriber>> subscribers_;
     std::unique_ptr<EventDetected> eventDetected_;
     std::unique_ptr<ServiceWorker> serviceWorker_;
+    std::unique_ptr<PreConnectionThread> preconnectScheduler_;
     std::unique_ptr<SocketServer> phoneServer_;
     std::shared_ptr<WlanReportDevices> wlanReportDevices_;
     std::unique_ptr<WlanDeviceDelete> wlanDeviceDelete_;

@@ -2,18 +2,47 @@
 
 #include <string>
 
+#include "account/DataInstance.h"
 #include "core/Log.h"
+#include "preconnect/DeviceWaitForPreConnectManager.h"
 
 namespace kesu {
 
 PreConnectEventSubscriber::PreConnectEventSubscriber(EventLoop& loop)
+    : PreConnectEventSubscriber(loop, DeviceWaitForPreConnectManager::instance()) {}
+
+PreConnectEventSubscriber::PreConnectEventSubscriber(EventLoop& loop, DeviceWaitForPreConnectManager& registry)
     : IEventSubscriber(loop, {ServiceEvent::WifiOpen, ServiceEvent::WifiClose, ServiceEvent::LogOn,
                               ServiceEvent::Pcsuite, ServiceEvent::NetworkChange, ServiceEvent::AccountChange,
-                              ServiceEvent::DeviceListUpdate, ServiceEvent::DeviceInfoReport}) {}
+                              ServiceEvent::DeviceListUpdate, ServiceEvent::DeviceInfoReport}),
+      registry_(registry) {}
 
 void PreConnectEventSubscriber::eventNotify(ServiceEvent event) {
-    Log::mPrintlog(std::string("[PreConnectEventSubscriber::eventNotify] preconnect eventNotify ") +
-                     eventName(event) + ": pre-connection not built yet, no device to adjust");
+    if (!handles(event)) return;
+    const auto devices = registry_.getAllDevices();
+    Log::mPrintlog("[PreConnectEventSubscriber::eventNotify] preconnect eventNotify, reset connect count");
+    switch (event) {
+    case ServiceEvent::Pcsuite:
+        for (const auto& device : devices) device->reduceConnectCount();
+        break;
+    case ServiceEvent::WifiClose:
+    case ServiceEvent::NetworkChange:
+        for (const auto& device : devices) device->setIsDisconnectNow(true);
+        Log::mPrintlog("[PreConnectEventSubscriber::eventNotify] Wifi close or network change ... \n");
+        break;
+    case ServiceEvent::AccountChange:
+        if (!dataInstance().get(&databaseParam::openid).empty()) {
+            for (const auto& device : devices) device->setFirstConnect(true);
+        } else {
+            for (const auto& device : devices) device->disconnectPreConnect();
+            Log::mPrintlog("[PreConnectEventSubscriber::eventNotify] account log off, clear all devices ... \n");
+            registry_.clearAllDevices();
+        }
+        break;
+    default:
+        for (const auto& device : devices) device->resetConnectCount();
+        break;
+    }
 }
 
 }  // namespace kesu

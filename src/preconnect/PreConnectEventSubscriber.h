@@ -1,17 +1,23 @@
 // The pre-connection side of the event bus: when the PC's situation changes (network,
-// Wi-Fi, log-on, account, PC suite requests) the devices waiting for pre-connection are to be
-// adjusted. Pre-connection is not built yet, so the registry holds no device and the
-// subscriber only logs the event it took.
+// Wi-Fi, log-on, account, PC suite requests) the devices waiting for pre-connection are
+// adjusted: failure counts wiped or lowered, held links ended, or everything dropped when
+// the account signs out.
 #pragma once
 
 #include "events/IEventSubscriber.h"
 
 namespace kesu {
 
+class DeviceWaitForPreConnectManager;
+
 class PreConnectEventSubscriber : public IEventSubscriber {
 public:
     explicit PreConnectEventSubscriber(EventLoop& loop);
+    PreConnectEventSubscriber(EventLoop& loop, DeviceWaitForPreConnectManager& registry);
     void eventNotify(ServiceEvent event) override;
+
+private:
+    DeviceWaitForPreConnectManager& registry_;
 };
 
 }  // namespace kesu
