@@ -20,6 +20,14 @@
 //   --answer accept|reject|busy|silent
 //                        answer to a PC's request (default accept); prints
 //                        "SIM TCP_REQUEST <body>" and "SIM TCP_ANSWERED <tag>"
+//   --preconnect answer|silent|garbage|half|huge|hangup
+//                        with --tcp-port: play a phone of the account that a PC pre-connects;
+//                        its request ([22]) gets a reply ([23] with --openid and --id, or a
+//                        broken one) and the link is held; prints "SIM TCP_ANSWERED 23"
+//   --ask-connect-after S  with --preconnect: S seconds after the start, ask the PC over every
+//                        held link to be connected ([24]); prints "SIM PRECONNECT_ASKED"
+//   --close-after S      with --tcp-port: close every link S seconds after the start; prints
+//                        "SIM LINKS_CLOSED"
 //   --connect HOST:PORT  send a connection request to a PC; prints "SIM TCP_ANSWER <body>"
 //                        (bodies are printed on one line, JSON compacted)
 //   --service S          service id of that request (default com.kesu.pcsuite.SERVICE)
@@ -55,6 +63,9 @@ struct Options {
     std::string answer = "accept";
     std::string connect;
     std::string service = "com.kesu.pcsuite.SERVICE";
+    std::string preconnect;
+    int askConnectAfter = -1;
+    int closeAfter = -1;
     int duration = 30;
 };
 
@@ -82,16 +93,17 @@ void usage() {
     std::cout << "phone_simulator [--iface-ip IP] [--name N] [--id I] [--account A] [--openid O]\n"
                  "  [--guide G] [--type mobile|pad] [--format current|old] [--announce-every S]\n"
                  "  [--listen] [--tcp-port P] [--answer accept|reject|busy|silent]\n"
-                 "  [--connect HOST:PORT] [--service S] [--duration S] [--help]\n";
+                 "  [--preconnect answer|silent|garbage|half|huge|hangup] [--ask-connect-after S]\n"
+                 "  [--close-after S] [--connect HOST:PORT] [--service S] [--duration S] [--help]\n";
 }
 
 bool parse(int argc, char** argv, Options& o) {
     std::map<std::string, std::string*> text{{"--iface-ip", &o.ifaceIp}, {"--name", &o.phone.name},
         {"--id", &o.phone.id}, {"--account", &o.phone.account}, {"--openid", &o.phone.openId},
         {"--guide", &o.phone.guide}, {"--type", &o.phone.type}, {"--format", &o.format}, {"--answer", &o.answer},
-        {"--connect", &o.connect}, {"--service", &o.service}};
+        {"--connect", &o.connect}, {"--service", &o.service}, {"--preconnect", &o.preconnect}};
     std::map<std::string, int*> number{{"--announce-every", &o.announceEvery}, {"--tcp-port", &o.tcpPort},
-        {"--duration", &o.duration}};
+        {"--duration", &o.duration}, {"--ask-connect-after", &o.askConnectAfter}, {"--close-after", &o.closeAfter}};
     for (int i = 1; i < argc; ++i) {
         std::string a = argv[i];
         if (a == "--help") return usage(), false;
@@ -160,15 +172,34 @@ int main(int argc, char** argv) {
         options.host = "0.0.0.0";
         options.port = o.tcpPort;
         options.answer = answerNamed(o.answer).value_or(Answer::Accept);
+        if (!o.preconnect.empty()) {
+            const auto mode = preconnectModeNamed(o.preconnect);
+            if (!mode) { std::cerr << "unknown --preconnect mode " << o.preconnect << "\n"; return 2; }
+            options.answer = Answer::Silent;
+            options.preconnect = PreconnectReply{*mode, o.phone.openId, o.phone.id, ""};
+        }
         listener = std::make_unique<Listener>(options, sayEvent);
         if (!listener->ok()) { say("TCP_SETUP_FAILED " + listener->error()); return 1; }
     }
     say("READY");
     if (!o.connect.empty()) connectToPc(o, deadline);
 
+    const auto started = Clock::now();
+    auto after = [&](int seconds) { return seconds < 0 ? Clock::time_point::max() : started + std::chrono::seconds(seconds); };
+    auto askAt = listener && !o.preconnect.empty() ? after(o.askConnectAfter) : Clock::time_point::max();
+    auto closeAt = listener ? after(o.closeAfter) : Clock::time_point::max();
     auto nextAnnounce = Clock::now();
     bool announcedOnce = false;
     while (Clock::now() < deadline) {
+        if (Clock::now() >= askAt) {
+            say(listener->sendToAll(R"({"bytes":[24]})") ? "PRECONNECT_ASKED" : "PRECONNECT_ASK_FAILED");
+            askAt = Clock::time_point::max();
+        }
+        if (Clock::now() >= closeAt) {
+            listener->closeAll();
+            say("LINKS_CLOSED");
+            closeAt = Clock::time_point::max();
+        }
         if (udp && o.announceEvery >= 0 && Clock::now() >= nextAnnounce && !(o.announceEvery == 0 && announcedOnce)) {
             const std::string error = udp->announce(o.phone, o.format == "old");
             say(error.empty() ? "ANNOUNCED" : "ANNOUNCE_FAILED " + error);
@@ -177,6 +208,7 @@ int main(int argc, char** argv) {
         }
         auto wake = deadline;
         if (udp && o.announceEvery > 0) wake = std::min(wake, nextAnnounce);
+        wake = std::min({wake, askAt, closeAt});
         const auto ms = std::chrono::duration_cast<std::chrono::milliseconds>(wake - Clock::now()).count();
         pollfd heard{udp && o.listen ? udp->fd() : -1, POLLIN, 0};
         if (::poll(&heard, 1, static_cast<int>(std::clamp<long long>(ms, 0, 1000))) > 0 && (heard.revents & POLLIN))

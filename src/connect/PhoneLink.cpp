@@ -5,6 +5,10 @@
 #include <asio/experimental/awaitable_operators.hpp>
 #include <asio/use_awaitable.hpp>
 
+#include <netinet/in.h>
+#include <netinet/tcp.h>
+#include <sys/socket.h>
+
 #include "core/Config.h"
 #include "core/Log.h"
 
@@ -46,6 +50,17 @@ asio::awaitable<std::optional<T>> PhoneLink::beforeDeadline(asio::awaitable<T> o
     auto first = co_await (std::move(operation) || timer.async_wait(kTuple));
     if (first.index() == 0) co_return std::move(std::get<0>(first));
     co_return std::nullopt;
+}
+
+bool PhoneLink::enableKeepAlive(int idleSeconds, int intervalSeconds, int probes) {
+    if (!socket_.is_open()) return false;
+    asio::error_code ec;
+    socket_.set_option(asio::socket_base::keep_alive(true), ec);
+    if (ec) return false;
+    const int fd = socket_.native_handle();
+    return ::setsockopt(fd, IPPROTO_TCP, TCP_KEEPIDLE, &idleSeconds, sizeof idleSeconds) == 0 &&
+           ::setsockopt(fd, IPPROTO_TCP, TCP_KEEPINTVL, &intervalSeconds, sizeof intervalSeconds) == 0 &&
+           ::setsockopt(fd, IPPROTO_TCP, TCP_KEEPCNT, &probes, sizeof probes) == 0;
 }
 
 void PhoneLink::shut() {

@@ -55,6 +55,10 @@ public:
     // Why readFrame gave Closed: "" for the peer's orderly close, else the error.
     const std::string& readError() const { return readError_; }
 
+    // TCP keep-alive on a connected link: the first probe after `idleSeconds` without
+    // traffic, then one every `intervalSeconds`, the link given up after `probes` unanswered.
+    bool enableKeepAlive(int idleSeconds, int intervalSeconds, int probes);
+
     // Ends the link; repeated calls do nothing.
     void shut();
     bool isShut() const { return shut_.load(); }

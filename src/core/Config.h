@@ -27,6 +27,8 @@ struct Config {
     std::string pcsuiteHost = "127.0.0.1";
     int pcsuitePort = 9199;
     int pushClientUdpPort = 13601;
+    // The local telemetry collector (datagrams to 127.0.0.1).
+    int telemetryUdpPort = 9997;
 
     // Phone-side TCP port (both directions) and LAN discovery.
     int phoneTcpPort = 10191;
@@ -63,6 +65,22 @@ struct Config {
 
     // How long preconnect_startScan waits for the cloud device list to fill the registry.
     std::chrono::milliseconds preconnectScanWait{5000};
+    // Pre-connection: each address of a device gets preconnectConnectTimeout to accept the
+    // link, the handshake's request and reply preconnectHandshakeTimeout each. A held link
+    // keeps at most preconnectQueueMaxFrames frames (and preconnectQueueMaxBytes) of the
+    // phone's for the connect flow, none older than preconnectQueueMaxAge; at most
+    // preconnectMaxPendingRequests requests of the phone wait for their answer. TCP keep-alive
+    // on held links: first probe after the idle time, then every interval, given up after
+    // the count.
+    std::chrono::milliseconds preconnectConnectTimeout{3000};
+    std::chrono::milliseconds preconnectHandshakeTimeout{3000};
+    std::size_t preconnectQueueMaxFrames = 64;
+    std::size_t preconnectQueueMaxBytes = 4 << 20;
+    std::chrono::milliseconds preconnectQueueMaxAge{120000};
+    std::size_t preconnectMaxPendingRequests = 8;
+    int preconnectKeepAliveIdle = 30;
+    int preconnectKeepAliveInterval = 10;
+    int preconnectKeepAliveProbes = 3;
 
     // Screen-lock watcher period.
     std::chrono::milliseconds screenLockPeriod{3000};

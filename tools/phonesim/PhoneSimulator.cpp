@@ -201,6 +201,23 @@ bool Link::closedByPeer(std::chrono::milliseconds timeout) {
     return read(body, timeout) == Got::Closed;
 }
 
+// ---- Pre-connect replies
+
+std::optional<PreconnectReply::Mode> preconnectModeNamed(const std::string& name) {
+    using Mode = PreconnectReply::Mode;
+    static const std::pair<const char*, Mode> names[] = {{"answer", Mode::Answer},       {"silent", Mode::Silent},
+                                                         {"garbage", Mode::Garbage},     {"half", Mode::HalfFrame},
+                                                         {"huge", Mode::Huge},           {"hangup", Mode::HangUp}};
+    for (const auto& [text, mode] : names)
+        if (name == text) return mode;
+    return std::nullopt;
+}
+
+nlohmann::json preconnectReplyBody(const PreconnectReply& reply) {
+    return {{"bytes", {23}},   {"open_Id", reply.openId}, {"target_id", reply.targetId},
+            {"deviceName", "kesu Sim Phone"}, {"service_id", kPcsuiteService}, {"type", 1}};
+}
+
 // ---- Listener
 
 std::optional<Answer> answerNamed(const std::string& name) {
@@ -239,6 +256,7 @@ Listener::Listener(Options options, std::function<void(const Event&)> onEvent)
     ::getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length);
     port_ = ntohs(address.sin_port);
     stopFd_ = ::eventfd(0, EFD_CLOEXEC);
+    commandFd_ = ::eventfd(0, EFD_CLOEXEC);
     listenFd_ = fd;
     thread_ = std::thread([this] { serve(); });
 }
@@ -251,6 +269,77 @@ Listener::~Listener() {
     }
     if (listenFd_ >= 0) ::close(listenFd_);
     if (stopFd_ >= 0) ::close(stopFd_);
+    if (commandFd_ >= 0) ::close(commandFd_);
+}
+
+bool Listener::run(Command command) {
+    auto done = std::make_shared<std::promise<void>>();
+    auto finished = done->get_future();
+    {
+        std::lock_guard<std::mutex> lock(mutex_);
+        commands_.emplace_back(std::move(command), done);
+    }
+    const std::uint64_t one = 1;
+    [[maybe_unused]] const auto written = ::write(commandFd_, &one, sizeof one);
+    return finished.wait_for(std::chrono::seconds(10)) == std::future_status::ready;
+}
+
+std::size_t Listener::links() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return linkCount_;
+}
+
+bool Listener::sendToAll(const std::string& body, int times) {
+    auto taken = std::make_shared<bool>(false);
+    const Bytes frame = buildPhoneFrame(body);
+    const bool ran = run([&frame, times, taken](std::vector<Peer>& peers) {
+        for (Peer& peer : peers)
+            for (int i = 0; i < times; ++i) *taken = writeAll(peer.fd, frame) || *taken;
+    });
+    return ran && *taken;
+}
+
+void Listener::closeAll(bool reset) {
+    run([reset](std::vector<Peer>& peers) {
+        for (const Peer& peer : peers) {
+            if (reset) {
+                const linger abort{1, 0};
+                ::setsockopt(peer.fd, SOL_SOCKET, SO_LINGER, &abort, sizeof abort);
+            }
+            ::close(peer.fd);
+        }
+        peers.clear();
+    });
+}
+
+void Listener::answerPreconnect(Peer& peer) {
+    using Mode = PreconnectReply::Mode;
+    const PreconnectReply& reply = *options_.preconnect;
+    Bytes out;
+    switch (reply.mode) {
+    case Mode::Answer:
+        out = reply.body.empty() ? buildPhoneFrameFromJson(preconnectReplyBody(reply)) : buildPhoneFrame(reply.body);
+        break;
+    case Mode::Silent:
+    case Mode::HangUp:
+        return;
+    case Mode::Garbage: {
+        const std::string junk = "HTTP/1.1 200 OK\r\n\r\nnot a frame at all";
+        out.assign(junk.begin(), junk.end());
+        break;
+    }
+    case Mode::HalfFrame:
+    case Mode::Huge: {
+        const std::size_t announced = reply.mode == Mode::Huge ? (std::size_t{1} << 20) + 1 : 200;
+        out.assign(kPhoneFrameTag.begin(), kPhoneFrameTag.end());
+        const auto length = lenTo4Bytes(announced);
+        out.insert(out.end(), length.begin(), length.end());
+        out.resize(out.size() + (reply.mode == Mode::Huge ? announced : 20), '{');
+        break;
+    }
+    }
+    peer.answered = writeAll(peer.fd, out);
+    report({Event::Kind::Answered, "", 23, false});
 }
 
 void Listener::report(const Event& event) {
@@ -290,7 +379,17 @@ bool Listener::onData(Peer& peer) {
     peer.cutter.feed(std::string_view(buffer, static_cast<std::size_t>(n)));
     while (auto frame = peer.cutter.next()) {
         peer.requested = true;
-        report({Event::Kind::Request, phoneFrameBody(*frame), 0, false});
+        const std::string body = phoneFrameBody(*frame);
+        report({Event::Kind::Request, body, 0, false});
+        if (options_.preconnect && phoneFrameTag(body) == 22) {
+            if (options_.preconnect->mode == PreconnectReply::Mode::HangUp) {
+                report({Event::Kind::Closed, "", 0, false});
+                return false;
+            }
+            answerPreconnect(peer);
+            continue;
+        }
+        if (options_.preconnect) continue;  // a pre-connected phone answers nothing else
         if (peer.answered || options_.answer == Answer::Silent) continue;
         if (options_.answer == Answer::HangUp) {
             report({Event::Kind::Closed, "", 0, false});
@@ -310,17 +409,35 @@ bool Listener::onData(Peer& peer) {
 void Listener::serve() {
     std::vector<Peer> peers;
     for (;;) {
-        std::vector<pollfd> fds{{stopFd_, POLLIN, 0}, {listenFd_, POLLIN, 0}};
+        {
+            std::lock_guard<std::mutex> lock(mutex_);
+            linkCount_ = peers.size();
+        }
+        std::vector<pollfd> fds{{stopFd_, POLLIN, 0}, {listenFd_, POLLIN, 0}, {commandFd_, POLLIN, 0}};
         for (const Peer& peer : peers) fds.push_back({peer.fd, POLLIN, 0});
         if (::poll(fds.data(), fds.size(), -1) < 0) {
             if (errno == EINTR) continue;
             break;
         }
         if (fds[0].revents != 0) break;
+        if (fds[2].revents != 0) {
+            std::uint64_t count = 0;
+            [[maybe_unused]] const auto got = ::read(commandFd_, &count, sizeof count);
+            std::deque<std::pair<Command, std::shared_ptr<std::promise<void>>>> commands;
+            {
+                std::lock_guard<std::mutex> lock(mutex_);
+                commands.swap(commands_);
+            }
+            for (auto& [command, done] : commands) {
+                command(peers);
+                done->set_value();
+            }
+            continue;  // the set of links may have changed
+        }
         // Links first: a new link's descriptor is not in this round's set.
         std::vector<Peer> kept;
         for (std::size_t i = 0; i < peers.size(); ++i) {
-            if ((fds[i + 2].revents & (POLLIN | POLLHUP | POLLERR)) && !onData(peers[i])) {
+            if ((fds[i + 3].revents & (POLLIN | POLLHUP | POLLERR)) && !onData(peers[i])) {
                 ::close(peers[i].fd);
                 continue;
             }

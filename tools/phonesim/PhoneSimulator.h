@@ -10,6 +10,7 @@
 #include <cstdint>
 #include <deque>
 #include <functional>
+#include <future>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -101,10 +102,29 @@ enum class Answer {
 // "accept", "reject", "busy", "silent"; nullopt for any other name.
 std::optional<Answer> answerNamed(const std::string& name);
 
+// How a phone of the account answers a PC's pre-connect request ([22]); the link is then held.
+struct PreconnectReply {
+    enum class Mode {
+        Answer,     // [23] with the account and identity below (or `body`)
+        Silent,     // says nothing
+        Garbage,    // bytes that are no frame
+        HalfFrame,  // a frame header announcing more body than is ever sent
+        Huge,       // a frame announcing a body over 1 MiB, and sending it
+        HangUp,     // closes the link
+    } mode = Mode::Answer;
+    std::string openId = "sim-open-id";  // "open_Id": the phone's account
+    std::string targetId = "SIMPHONE01";  // "target_id": its first 4 characters make the device key
+    std::string body;                     // when set, the [23] body sent as is
+};
+// "answer", "silent", "garbage", "half", "huge", "hangup"; nullopt for any other name.
+std::optional<PreconnectReply::Mode> preconnectModeNamed(const std::string& name);
+// The phone's [23] reply body.
+nlohmann::json preconnectReplyBody(const PreconnectReply& reply);
+
 // A phone listening for PCs' connection requests; each link gets one answer (for its first
-// request) and is kept until the PC closes it. (A held link of a pre-connection is the same
-// shape: a further Answer that replies to its request and keeps sending on the held link
-// fits in onData.)
+// request) and is kept until the PC closes it. With `preconnect` set, a PC's pre-connect
+// request gets that reply instead, and the held link can be driven from the test (send,
+// flood, close).
 class Listener {
 public:
     struct Options {
@@ -113,6 +133,7 @@ public:
         Answer answer = Answer::Accept;
         std::string answerBody;          // when set, the body sent instead of {"bytes":[tag]}
         std::size_t maxLinks = 16;
+        std::optional<PreconnectReply> preconnect;
     };
     struct Event {
         enum class Kind { Accepted, Request, Answered, Closed } kind;
@@ -136,9 +157,20 @@ public:
     std::optional<std::string> request(std::chrono::milliseconds timeout);
     // True once the PC closed a link it had sent a request on.
     bool pcClosed(std::chrono::milliseconds timeout);
+    // The number of links open now.
+    std::size_t links();
+    // Sends a frame with `body` on every open link, `times` times each; false when no link
+    // took it. Waits until the serving thread has done it (bounded).
+    bool sendToAll(const std::string& body, int times = 1);
+    // Closes every link: an orderly close, or a reset (RST) when `reset`.
+    void closeAll(bool reset = false);
 
 private:
     struct Peer;
+    using Command = std::function<void(std::vector<Peer>&)>;
+    // Runs `command` on the serving thread and waits for it (bounded).
+    bool run(Command command);
+    void answerPreconnect(Peer& peer);
     void serve();
     void report(const Event& event);
     bool onData(Peer& peer);
@@ -147,6 +179,9 @@ private:
     std::function<void(const Event&)> onEvent_;
     int listenFd_ = -1;
     int stopFd_ = -1;
+    int commandFd_ = -1;
+    std::deque<std::pair<Command, std::shared_ptr<std::promise<void>>>> commands_;  // guarded by mutex_
+    std::size_t linkCount_ = 0;                                                   // guarded by mutex_
     int port_ = 0;
     std::string error_;
     std::mutex mutex_;

@@ -1,0 +1,229 @@
+// The pre-connect handshake and the held link, against the simulated phone on loopback.
+#include "PreconnectFixture.h"
+
+#include "connect/PhoneLink.h"
+#include "connect/Step.h"
+
+namespace kesu {
+namespace {
+
+using namespace std::chrono_literals;
+using test::PreconnectTest;
+using Mode = phonesim::PreconnectReply::Mode;
+
+std::string stepEntry(const StepStruct& step, Result result) {
+    return sharedStep().getConnectCodeV2(step) + sharedStep().getConnectResult(step, result);
+}
+
+TEST(FarawayDeviceTest, CloudRecordBecomesTheRecordAndItsLocalForm) {
+    FarawayDevice device;
+    device.setAllInfo({{"type", 4},
+                       {"btSwitch", 1},
+                       {"ext", {{"k", {1, 2}}}},
+                       {"bizInfo", {{"conn_base", {{"businessId", "abcdef"}}}}},
+                       {"inets", {{{"localInet", ""}}, {{"localInet", "10.0.0.9"}, {"ssid", "Home"}}, {{"inet", "x"}}}}});
+    const Json local = device.getLocalInfo();
+    EXPECT_EQ(device.getDeviceId(), "61626364");  // only the first four characters count
+    EXPECT_EQ(local["type"], "unknowed");
+    EXPECT_EQ(local["btSwitch"], 1);
+    EXPECT_EQ(local["wifiSwitch"], 0);  // a missing key reads as 0
+    EXPECT_EQ(local["ext"], Json({{"k", {1, 2}}}));
+    ASSERT_EQ(local["inets"].size(), 3u);
+    EXPECT_EQ(local["inets"][1], Json({{"inet", ""}, {"localInet", "10.0.0.9"}, {"netmark", ""}, {"ssid", "Home"}}));
+    EXPECT_TRUE(device.isWlanConnectSupport());
+
+    FarawayDevice bare;
+    bare.setAllInfo({{"bizInfo", {{"conn_base", {{"businessId", "ab"}}}}}, {"inets", {{{"localInet", ""}}}}});
+    EXPECT_EQ(bare.getDeviceId(), "6162");
+    EXPECT_FALSE(bare.isWlanConnectSupport());
+    FarawayDevice none;
+    none.setAllInfo(Json::object());
+    EXPECT_EQ(none.getDeviceId(), "");
+    EXPECT_FALSE(none.getLocalInfo().contains("inets"));
+}
+
+TEST(FarawayDeviceTest, ClientGenerations) {
+    EventLoop loop;
+    FarawayDevice device;
+    EXPECT_TRUE(device.destroyClient());  // nothing to close
+    device.createClient("", loop.executor());
+    EXPECT_EQ(device.getCommunicationChannel(), nullptr);
+    device.createClient(FarawayDevice::kWlan, loop.executor());
+    const auto first = device.getCommunicationChannel();
+    device.createClient(FarawayDevice::kWlan, loop.executor());
+    EXPECT_EQ(device.getCommunicationChannel(), first);
+    EXPECT_EQ(device.getClientId(), 1);
+    device.destroyClient();
+    EXPECT_EQ(device.getCommunicationChannel(), nullptr);
+    EXPECT_EQ(device.getClientId(), 1);
+    device.createClient(FarawayDevice::kWlan, loop.executor());
+    EXPECT_EQ(device.getClientId(), 2);
+    device.destroyClient();
+}
+
+TEST_F(PreconnectTest, AcceptedHandshakeHoldsTheLinkAndAnswersThePhone) {
+    pcsuite.setAnswer("/connectDevice", {200, R"({"code":"000000","data":{"code":7,"reason":"shown"}})"});
+    phonesim::Listener phone(phoneOptions());
+    ASSERT_TRUE(phone.ok());
+    const auto entry = entryFor(phone.port());
+
+    ASSERT_EQ(handshake(entry), true);
+    // Only the ping outcome is traced for an attempt that succeeded.
+    EXPECT_EQ(entry->getPreConnectStep(), stepEntry(sharedStep().OS4_WLAN_PING_ADDRESS, Result::FAILED));
+    EXPECT_EQ(entry->getWlanDeviceIp(), "127.0.0.1");
+    EXPECT_TRUE(entry->getIsOpenIdSame());
+    const Json request = Json::parse(nextOfTag(phone, 22));
+    EXPECT_EQ(request, Json({{"bytes", {22}}, {"deviceName", "Off****-PC"}, {"channel", 0}, {"id", 87654321},
+                             {"open_Id", "openid-of-pc"}, {"service_id", "com.kesu.pcsuite.SERVICE"},
+                             {"target_id", "aabbccddeeff"}, {"account", "138****5678"}, {"type", 1}}));
+
+    // Frames that are not requests stay queued, oldest first.
+    ASSERT_TRUE(phone.sendToAll(R"({"bytes":[30],"n":1})"));
+    ASSERT_TRUE(phone.sendToAll(R"({"bytes":[31],"n":2})"));
+    // A request to connect is acknowledged at once, then answered with the PC suite's outcome.
+    ASSERT_TRUE(phone.sendToAll(R"({"bytes":[24]})"));
+    const std::string ack = nextOfTag(phone, 25);
+    ASSERT_FALSE(ack.empty());
+    EXPECT_EQ(Json::parse(ack)["extra_info"], "");
+    const std::string result = nextOfTag(phone, 27);
+    ASSERT_FALSE(result.empty());
+    EXPECT_EQ(Json::parse(result)["extra_info"], R"({"retCode":7,"retMsg":"shown"})");
+    const auto asked = pcsuite.requestsTo("/connectDevice");
+    ASSERT_EQ(asked.size(), 1u);
+    EXPECT_EQ(Json::parse(asked[0].body),
+              Json({{"requestSource", "preconnect"}, {"eventId", "12345678"}, {"deviceId", entry->getDeviceId()}}));
+
+    Bytes frame;
+    ASSERT_TRUE(entry->getQueueMessage(frame));
+    EXPECT_EQ(phoneFrameBody(frame), R"({"bytes":[30],"n":1})");
+    ASSERT_TRUE(entry->getQueueMessage(frame));
+    EXPECT_EQ(phoneFrameBody(frame), R"({"bytes":[31],"n":2})");
+    EXPECT_FALSE(entry->getQueueMessage(frame));
+
+    // The phone goes: exactly one abnormal notice for the device.
+    phone.closeAll(true);
+    ASSERT_TRUE(notices->waitFor(1, 5s));
+    EXPECT_EQ(notices->ids(), std::vector<std::string>{entry->getDeviceId()});
+}
+
+TEST_F(PreconnectTest, PcSuiteDownStillGivesThePhoneAnEmptyResult) {
+    env.config().pcsuitePort = test::freeTcpPort();
+    phonesim::Listener phone(phoneOptions());
+    const auto entry = entryFor(phone.port());
+    ASSERT_EQ(handshake(entry), true);
+    ASSERT_TRUE(phone.sendToAll(R"({"bytes":[24]})"));
+    ASSERT_FALSE(nextOfTag(phone, 25).empty());
+    const std::string result = nextOfTag(phone, 27);
+    ASSERT_FALSE(result.empty());
+    EXPECT_EQ(Json::parse(result)["extra_info"], "{}");
+}
+
+// Every way a phone can fail the handshake ends the attempt within the time-outs, names the
+// failed step, and leaves no descriptor behind once the link is destroyed.
+TEST_F(PreconnectTest, RefusedHandshakes) {
+    const auto& step = sharedStep();
+    const std::string pingFailed = stepEntry(step.OS4_WLAN_PING_ADDRESS, Result::FAILED) + "_";
+    struct Case {
+        const char* name;
+        phonesim::PreconnectReply reply;
+        const StepStruct& failed;
+        bool openIdSame = true;
+    };
+    phonesim::PreconnectReply otherAccount;
+    otherAccount.openId = "someone-else";
+    phonesim::PreconnectReply otherDevice;
+    otherDevice.targetId = "OTHERPHONE";
+    phonesim::PreconnectReply blank;
+    blank.body = R"({"bytes": [23],"open_Id":"openid-of-pc","target_id":"SIMPHONE01"})";
+    phonesim::PreconnectReply wrongKind;
+    wrongKind.body = R"({"bytes":[1],"open_Id":"openid-of-pc","target_id":"SIMPHONE01"})";
+    const Case cases[] = {
+        {"other account", otherAccount, step.OS4_WLAN_PARSER_DEVICE_INFO, false},
+        {"other device", otherDevice, step.OS4_WLAN_PARSER_DEVICE_INFO},
+        {"blank in the kind", blank, step.OS4_WLAN_PARSER_DEVICE_INFO},
+        {"wrong kind", wrongKind, step.OS4_WLAN_PARSER_DEVICE_INFO},
+        {"silent", {Mode::Silent}, step.OS4_WLAN_RECV_DEVICE_INFO},
+        {"garbage", {Mode::Garbage}, step.OS4_WLAN_RECV_DEVICE_INFO},
+        {"half frame", {Mode::HalfFrame}, step.OS4_WLAN_RECV_DEVICE_INFO},
+        {"1 MiB frame", {Mode::Huge}, step.OS4_WLAN_RECV_DEVICE_INFO},
+        {"hang-up", {Mode::HangUp}, step.OS4_WLAN_RECV_DEVICE_INFO},
+    };
+    std::optional<std::size_t> descriptors;
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        phonesim::Listener phone(phoneOptions(c.reply));
+        ASSERT_TRUE(phone.ok());
+        const auto entry = entryFor(phone.port());
+        EXPECT_EQ(handshake(entry), false);
+        EXPECT_EQ(entry->getPreConnectStep(), pingFailed + stepEntry(c.failed, Result::FAILED));
+        EXPECT_EQ(entry->getIsOpenIdSame(), c.openIdSame);
+        entry->getFarawayDevice()->destroyClient();
+        loop.call([] {});
+        // Counted from the first case on: the first attempt sets up what lives for the process.
+        if (!descriptors) descriptors = test::openDescriptors() - 3;  // the phone's listener and its two wake-ups
+    }
+    loop.call([] {});  // the links' closes have run
+    EXPECT_EQ(test::openDescriptors(), descriptors.value_or(0));
+    EXPECT_TRUE(notices->ids().empty());
+}
+
+TEST_F(PreconnectTest, NoListenerFailsAtTheConnectStep) {
+    const auto entry = entryFor(test::freeTcpPort());
+    EXPECT_EQ(handshake(entry), false);
+    EXPECT_EQ(entry->getPreConnectStep(),
+              stepEntry(sharedStep().OS4_WLAN_PING_ADDRESS, Result::FAILED) + "_" +
+                  stepEntry(sharedStep().OS4_WLAN_CONNECT_ADDRESS, Result::FAILED));
+
+    // Nothing happens for an entry that is not selected for FARAWAYWLAN.
+    entry->setConnectType("");
+    entry->setPreConnectStep("");
+    EXPECT_EQ(handshake(entry), false);
+    EXPECT_EQ(entry->getPreConnectStep(), "");
+    entry->addConnectCount();
+    EXPECT_EQ(entry->getFarawayWlanConnectCount(), 0);
+}
+
+TEST_F(PreconnectTest, FloodIsBoundedAndRequestsStillAnsweredPromptly) {
+    env.config().preconnectQueueMaxFrames = 8;
+    phonesim::Listener phone(phoneOptions());
+    const auto entry = entryFor(phone.port());
+    ASSERT_EQ(handshake(entry), true);
+    ASSERT_TRUE(phone.sendToAll(R"({"bytes":[30],"pad":")" + std::string(1000, 'x') + "\"}", 3000));
+    ASSERT_TRUE(phone.sendToAll(R"({"bytes":[24]})"));
+    EXPECT_FALSE(nextOfTag(phone, 25).empty());
+    EXPECT_EQ(loop.call([&] { return entry->queuedMessages(); }), std::optional<std::size_t>(8));
+}
+
+TEST_F(PreconnectTest, LinkEndsWithoutNoticeWhenTheRecordHasANewerLink) {
+    phonesim::Listener phone(phoneOptions());
+    const auto entry = entryFor(phone.port());
+    ASSERT_EQ(handshake(entry), true);
+    const auto record = entry->getFarawayDevice();
+    loop.call([&] {
+        record->destroyClient();
+        record->createClient(FarawayDevice::kWlan, loop.executor());
+    });
+    EXPECT_TRUE(phone.pcClosed(5s));
+    loop.call([] {});
+    EXPECT_TRUE(notices->ids().empty());
+    EXPECT_EQ(record->getClientId(), 2);
+}
+
+TEST_F(PreconnectTest, DisconnectRequestEndsTheHeldLinkWithANotice) {
+    phonesim::Listener phone(phoneOptions());
+    const auto entry = entryFor(phone.port());
+    ASSERT_EQ(handshake(entry), true);
+    entry->setIsDisconnectNow(true);
+    ASSERT_TRUE(notices->waitFor(1, 5s));
+    EXPECT_TRUE(phone.pcClosed(5s));
+
+    DeviceWaitForPreConnect orphan(loop);
+    orphan.setConnectType(FarawayDevice::kWlan);
+    orphan.setIsConnected(true);
+    orphan.disconnectPreConnect();
+    EXPECT_FALSE(orphan.getIsConnected());
+    EXPECT_EQ(orphan.getConnectType(), "");
+}
+
+}  // namespace
+}  // namespace kesu
