@@ -85,6 +85,11 @@ void HttpEventSubscriber::dispatchEvent(ServiceEvent event) {
 }
 
 bool HttpEventSubscriber::reportDeviceInfo() {
+    // Signed out: the center takes nothing, so the facts are not gathered either.
+    if (dataInstance().get(&databaseParam::openid).empty()) {
+        Log::mPrintlog("[HttpEventSubscriber::reportDeviceInfo] not signed in, no report \n");
+        return false;
+    }
     const Json report = Json::array({PcReport::build(PcReport::gather())});
     {
         std::lock_guard<std::mutex> lock(reportMutex_);
@@ -108,6 +113,11 @@ Json HttpEventSubscriber::lastReportDeviceInfo() const {
 }
 
 bool HttpEventSubscriber::unBindDevice() {
+    const databaseParam account = dataInstance().get();
+    if (account.openid.empty() || account.lastOpenId.empty()) {
+        Log::mPrintlog("[HttpEventSubscriber::unBindDevice] no previous account or signed out, nothing to unbind \n");
+        return false;
+    }
     const std::string id = pcDeviceId();
     if (id.empty()) {
         Log::mPrintlog("[HttpEventSubscriber::unBindDevice] no PC device id, nothing to unbind \n");

@@ -208,6 +208,7 @@ TEST_F(HttpEventSubscriberTest, AListForTheAccountSignedOutMeanwhileIsNeverMerge
     ASSERT_TRUE(subscriber->waitIdle(20s));
 
     EXPECT_EQ(registry.getDevicesSize(), 0);
+    EXPECT_EQ(center.requestCount(), 1u);  // signed out: nothing more is sent
     EXPECT_TRUE(test::logged(
         "[HttpEventSubscriber::getPreDeviceList] account changed while the list was fetched, the list is dropped"));
 }
