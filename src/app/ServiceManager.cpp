@@ -5,6 +5,7 @@
 #include "core/Config.h"
 #include "core/EventLoop.h"
 #include "app/RestartServiceSubscriber.h"
+#include "cloud/HttpEventSubscriber.h"
 #include "events/EventDetected.h"
 #include "events/SystemEventSubscriber.h"
 #include "core/Log.h"
@@ -53,6 +54,7 @@ void ServiceManager::start() {
 
     // Event subscribers, in their registration order.
     subscribers_ = {std::make_shared<PreConnectEventSubscriber>(loop_),
+                    std::make_shared<HttpEventSubscriber>(loop_),
                     std::make_shared<RestartServiceSubscriber>(loop_),
                     std::make_shared<SystemEventSubscriber>(loop_)};
     for (const auto& subscriber : subscribers_) EventPublisher::instance().addObserver(subscriber);
