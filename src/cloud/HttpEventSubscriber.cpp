@@ -10,7 +10,6 @@
 #include "core/Log.h"
 #include "pcsuite/RequestBase.h"
 #include "preconnect/DeviceWaitForPreConnectManager.h"
-#include "reports/DeviceListReporter.h"
 
 namespace kesu {
 
@@ -177,7 +176,7 @@ bool HttpEventSubscriber::getPreDeviceList(const std::string& triggerReason) {
         }
         registry_.addFarawayDevices(list);
     }
-    ReportDevicesV2::instance().notify();
+    DeviceWaitForPreConnectManager::instance().notifyListChanged();
     return true;
 }
 
