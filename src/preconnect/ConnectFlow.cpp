@@ -43,7 +43,7 @@ std::string ConnectFlow::start(const std::string& id, std::string& /*deviceType*
     Log::mPrintlog("[ConnectFlow::start] $$[Statistical][connectionspeed][wlan][node0][" + id + "]$$");
     if (!findPreconnectDevice(id, steps))
         return buildResult(rawValue(ErrorCode::NOT_FOUND), "Preconnect device not find", steps);
-    // A held link exists only once pre-connection runs; until then no entry is connected.
+    // The connection over the held link is not built yet.
     return buildResult(rawValue(ErrorCode::UNKNOWN), "Preconnect type is unkonw", steps);
 }
 
