@@ -352,10 +352,8 @@ void FileMonitor::announce() {
     const std::string openid = dataInstance().get(&databaseParam::openid);
     if (!openid.empty()) {
         // Ask the local push client for its client id; the answer arrives on its own way.
-        const std::string query = json::pretty(Json{{"cmd", "QUERY_CLIENT_ID"}, {"openId", openid}});
-        UdpSocketBase socket;
-        if (socket.initial(static_cast<std::uint16_t>(pushClientPort_), "127.0.0.1", -1))
-            socket.sendMsg(-1, Bytes(query.begin(), query.end()));
+        UdpSocketBase::sendToLocalPort(pushClientPort_,
+                                       json::pretty(Json{{"cmd", "QUERY_CLIENT_ID"}, {"openId", openid}}));
     }
     EventPublisher::instance().notifySubscribers(ServiceEvent::AccountChange);
 }

@@ -199,12 +199,8 @@ std::string connectCenterEvent(const requestObj& request, bool create) {
 }
 
 void sendClientIdQuery(const std::string& openid) {
-    const Config& config = Config::current();
-    UdpSocketBase socket;
-    if (!socket.initial(static_cast<std::uint16_t>(config.pushClientUdpPort), "127.0.0.1", -1)) return;
-    const std::string text = pretty(Json{{"cmd", "QUERY_CLIENT_ID"}, {"openId", openid}});
-    socket.sendMsg(-1, Bytes(text.begin(), text.end()));
-    socket.close();
+    UdpSocketBase::sendToLocalPort(Config::current().pushClientUdpPort,
+                                   pretty(Json{{"cmd", "QUERY_CLIENT_ID"}, {"openId", openid}}));
 }
 
 std::string accountChange(const requestObj& request) {

@@ -107,4 +107,13 @@ bool UdpSocketBase::isSocketNull() { return false; }
 
 std::string UdpSocketBase::getSocketType() { return "udp"; }
 
+bool UdpSocketBase::sendToLocalPort(int port, const std::string& text) {
+    if (port <= 0 || port > 65535) return false;
+    UdpSocketBase socket;
+    if (!socket.initial(static_cast<std::uint16_t>(port), "127.0.0.1", -1)) return false;
+    const bool sent = socket.sendMsg(-1, Bytes(text.begin(), text.end()));
+    socket.close();
+    return sent;
+}
+
 }  // namespace kesu

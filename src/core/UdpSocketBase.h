@@ -31,6 +31,10 @@ public:
     bool isSocketNull() override;
     std::string getSocketType() override;  // "udp"
 
+    // Sends `text` as one datagram to a listener on this machine (127.0.0.1:port, e.g. the
+    // push client or the telemetry collector); true when the system took it.
+    static bool sendToLocalPort(int port, const std::string& text);
+
 private:
     std::mutex mutex_;     // guards the two below
     int fd_ = -1;

@@ -1,5 +1,7 @@
 #include "pcsuite/BuryPoint.h"
 
+#include "core/WallClock.h"
+
 
 namespace kesu {
 
@@ -25,6 +27,16 @@ std::string BuryPoint::listText(const Record& record, bool pretty) {
     const std::string text = pretty ? record.dump(2, ' ', false, Record::error_handler_t::replace)
                                     : record.dump(-1, ' ', false, Record::error_handler_t::replace);
     return "[" + text + "]";
+}
+
+BuryPoint::Record BuryPoint::datagramRecord(const std::string& eventId, Record value) {
+    Record record;
+    record["pType"] = 0;
+    record["eventID"] = eventId;
+    record["value"] = std::move(value);
+    record["isDayReport"] = 0;
+    record["createTime"] = static_cast<long long>(WallClock::currentTimeStamp() * 1000);
+    return record;
 }
 
 }  // namespace kesu

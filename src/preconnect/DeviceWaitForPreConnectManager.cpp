@@ -258,12 +258,8 @@ bool DeviceWaitForPreConnectManager::sendDeviceListBuryPoint(const Json& req, in
 
 bool DeviceWaitForPreConnectManager::sendDeviceListFailBuryPoint(int status, const std::string& msg,
                                                                  const std::string& triggerReason) {
-    BuryPoint::Record record;
-    record["pType"] = 0;
-    record["eventID"] = "W688|10316";
-    record["value"] = {{"fail_code", status}, {"fail_reason", msg}, {"trigger_reason", triggerReason}};
-    record["isDayReport"] = 0;
-    record["createTime"] = static_cast<long long>(WallClock::currentTimeStamp() * 1000);
+    const BuryPoint::Record record = BuryPoint::datagramRecord(
+        "W688|10316", {{"fail_code", status}, {"fail_reason", msg}, {"trigger_reason", triggerReason}});
     std::string text;
     try {
         text = record.dump();
@@ -275,11 +271,7 @@ bool DeviceWaitForPreConnectManager::sendDeviceListFailBuryPoint(int status, con
     Log::mPrintlog(
         "[DeviceWaitForPreConnectManager::sendDeviceListFailBuryPoint] sendDeviceListFailBuryPoint, buryPointStr is: " +
         text);
-    UdpSocketBase socket;
-    if (!socket.initial(static_cast<std::uint16_t>(Config::current().telemetryUdpPort), "127.0.0.1", -1)) return false;
-    const bool sent = socket.sendMsg(3.0, Bytes(text.begin(), text.end()));
-    socket.close();
-    return sent;
+    return UdpSocketBase::sendToLocalPort(Config::current().telemetryUdpPort, text);
 }
 
 }  // namespace kesu

@@ -70,12 +70,7 @@ void sendAttemptRecord(const AttemptReport& attempt, const char* eventId, bool w
     params["hotspot_fre"] = "";
     params["hotspot_share"] = "";
     params["projection_com"] = 0;
-    BuryPoint::Record record;
-    record["pType"] = 0;
-    record["eventID"] = eventId;
-    record["value"] = std::move(params);
-    record["isDayReport"] = 0;
-    record["createTime"] = static_cast<long long>(WallClock::currentTimeStamp() * 1000);
+    const BuryPoint::Record record = BuryPoint::datagramRecord(eventId, std::move(params));
     std::string text;
     try {
         text = record.dump();
@@ -84,10 +79,7 @@ void sendAttemptRecord(const AttemptReport& attempt, const char* eventId, bool w
         return;
     }
     Log::mPrintlog(logPrefix + text);
-    UdpSocketBase socket;
-    if (socket.initial(static_cast<std::uint16_t>(Config::current().telemetryUdpPort), "127.0.0.1", -1))
-        socket.sendMsg(3.0, Bytes(text.begin(), text.end()));
-    socket.close();
+    UdpSocketBase::sendToLocalPort(Config::current().telemetryUdpPort, text);
 }
 
 }  // namespace
