@@ -15,7 +15,8 @@ PreConnectEventSubscriber::PreConnectEventSubscriber(EventLoop& loop, DeviceWait
     : IEventSubscriber(loop, {ServiceEvent::WifiOpen, ServiceEvent::WifiClose, ServiceEvent::LogOn,
                               ServiceEvent::Pcsuite, ServiceEvent::NetworkChange, ServiceEvent::AccountChange,
                               ServiceEvent::DeviceListUpdate, ServiceEvent::DeviceInfoReport}),
-      registry_(registry) {}
+      registry_(registry),
+      entriesOpenId_(dataInstance().get(&databaseParam::openid)) {}
 
 void PreConnectEventSubscriber::eventNotify(ServiceEvent event) {
     if (!handles(event)) return;
@@ -30,15 +31,24 @@ void PreConnectEventSubscriber::eventNotify(ServiceEvent event) {
         for (const auto& device : devices) device->setIsDisconnectNow(true);
         Log::mPrintlog("[PreConnectEventSubscriber::eventNotify] Wifi close or network change ... \n");
         break;
-    case ServiceEvent::AccountChange:
-        if (!dataInstance().get(&databaseParam::openid).empty()) {
-            for (const auto& device : devices) device->setFirstConnect(true);
-        } else {
+    case ServiceEvent::AccountChange: {
+        const std::string openId = dataInstance().get(&databaseParam::openid);
+        if (openId.empty()) {
             for (const auto& device : devices) device->disconnectPreConnect();
             Log::mPrintlog("[PreConnectEventSubscriber::eventNotify] account log off, clear all devices ... \n");
             registry_.clearAllDevices();
+        } else if (!entriesOpenId_.empty() && openId != entriesOpenId_) {
+            // Another account signed in without a sign-out between: no link of the previous
+            // account's devices may stay open, whether or not the new account's list arrives.
+            for (const auto& device : devices) device->disconnectPreConnect();
+            Log::mPrintlog("[PreConnectEventSubscriber::eventNotify] another account signed in, clear all devices");
+            registry_.clearAllDevices();
+        } else {
+            for (const auto& device : devices) device->setFirstConnect(true);
         }
+        entriesOpenId_ = openId;
         break;
+    }
     default:
         for (const auto& device : devices) device->resetConnectCount();
         break;

@@ -155,6 +155,22 @@ TEST_F(SchedulerTest, PcEventsAdjustEveryEntry) {
     EXPECT_FALSE(held->getIsConnected());
 }
 
+TEST_F(SchedulerTest, AnotherAccountSigningInEndsEveryHeldLinkOfThePrevious) {
+    DeviceWaitForPreConnectManager registry(&loop);
+    PreConnectEventSubscriber subscriber(loop, registry);
+    phonesim::Listener phone(phoneOptions());
+    env.config().phoneTcpPort = phone.port();
+    const auto held = add(registry, loop, "SIMP", "2026-12-06 10:00:00.000", 0);
+    held->setConnectType(FarawayDevice::kWlan);
+    ASSERT_EQ(handshake(held), true);
+
+    dataInstance().set(&databaseParam::openid, "openid-of-someone-else");
+    subscriber.eventNotify(ServiceEvent::AccountChange);  // no sign-out in between, no new list yet
+    EXPECT_TRUE(phone.pcClosed(5s));
+    EXPECT_EQ(registry.getDevicesSize(), 0);
+    EXPECT_FALSE(held->getIsConnected());
+}
+
 TEST(ReportPreconnectResultTest, OneWaiterPerDeviceAndOnlyItsOwnRemoval) {
     auto& results = ReportPreconnectResult::instance();
     EXPECT_FALSE(results.notify("X", "success"));  // nobody waits
