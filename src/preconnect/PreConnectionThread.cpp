@@ -143,6 +143,17 @@ asio::awaitable<void> PreConnectionThread::attempt() {
     report.ok = co_await entry->startPreConnect();
     current_.reset();
 
+    // The registry may have dropped the device while its handshake ran (a new cloud list, a
+    // sign-out): a link made for it is closed, not held for an entry nothing reaches any more.
+    DeviceWaitForPreConnectManager::Entry listed;
+    if (!registry_.lookupDevices(entry->getDeviceId(), listed) || listed != entry) {
+        Log::mPrintlog("[PreConnectionThread::run] " + entry->getDeviceId() +
+                       " left the registry during its pre-connect, its link is closed");
+        if (const auto record = entry->getFarawayDevice()) record->destroyClient();
+        entry->setConnectType("");
+        co_return;
+    }
+
     const std::string key = entry->getDeviceId();
     const auto record = entry->getFarawayDevice();
     if (!report.ok) {

@@ -171,6 +171,24 @@ TEST_F(SchedulerTest, AnotherAccountSigningInEndsEveryHeldLinkOfThePrevious) {
     EXPECT_FALSE(held->getIsConnected());
 }
 
+TEST_F(SchedulerTest, DeviceDroppedDuringItsHandshakeKeepsNoLink) {
+    auto& registry = DeviceWaitForPreConnectManager::instance();
+    const std::string id = deviceKeyOf("SIMP");
+    // The registry drops the device after the phone got the request and before it answers.
+    phonesim::Listener phone(phoneOptions(), [&](const phonesim::Listener::Event& event) {
+        if (event.kind == phonesim::Listener::Event::Kind::Request) registry.deleteDevices(id);
+    });
+    env.config().phoneTcpPort = phone.port();
+    registry.addFarawayDevices({{"data", {cloudRecord({"127.0.0.1"})}}});
+    DeviceWaitForPreConnectManager::Entry entry;
+    ASSERT_TRUE(registry.lookupDevices(id, entry));
+    scheduler.run();
+    ASSERT_TRUE(phone.request(5s));
+    EXPECT_TRUE(phone.pcClosed(5s));  // the answered handshake's link is not held
+    EXPECT_FALSE(entry->getIsConnected());
+    EXPECT_EQ(entry->getFarawayDevice()->getCommunicationChannel(), nullptr);
+}
+
 TEST(ReportPreconnectResultTest, OneWaiterPerDeviceAndOnlyItsOwnRemoval) {
     auto& results = ReportPreconnectResult::instance();
     EXPECT_FALSE(results.notify("X", "success"));  // nobody waits
