@@ -18,6 +18,7 @@ const std::string kOpenId = "same-open";
 // The registry's key of a phone: the hex of the first four characters of its business id.
 const std::string kAnswering = "PHA1", kAnsweringKey = "50484131";
 const std::string kSilent = "SIL3", kSilentKey = "53494c33";
+const std::string kStranger = "STR4", kStrangerKey = "53545234";
 const std::string kSuccess = "[PreConnectionThread::run] preConnect result is success, id ";
 const std::string kFailed = "[PreConnectionThread::run] preConnect result is failed, id ";
 const std::string kAbnormal = "PreConnectionAbnormalNotify, connection appear abnormal id is: ";
@@ -159,14 +160,17 @@ TEST_F(PreconnectE2E, DroppedLinkIsTornDownAndTakenUpAgain) {
     EXPECT_EQ(device["isConnected"], false) << device;
 }
 
-// A listed phone that never answers is tried twice and then left alone, while the other
-// listed phone is held.
-TEST_F(PreconnectE2E, SilentPhoneIsGivenUpAfterTwoTriesWhileAnotherIsHeld) {
+// Listed phones that never answer, or answer for another account, are tried at most twice
+// and then left alone, while the other listed phone is held.
+TEST_F(PreconnectE2E, RefusingPhonesAreGivenUpAfterTwoTriesWhileAnotherIsHeld) {
     const auto quiet = addPhone("phone2", 3);
-    // The silent phone reported last, so it is tried first.
-    listPhones({listed(phone, kAnswering, "2026-12-06 10:00:00.000"), listed(quiet, kSilent, "2026-12-06 11:00:00.000")});
+    const auto other = addPhone("phone3", 4);
+    // The refusing phones reported last, so they are tried first.
+    listPhones({listed(phone, kAnswering, "2026-12-06 10:00:00.000"), listed(quiet, kSilent, "2026-12-06 11:00:00.000"),
+                listed(other, kStranger, "2026-12-06 12:00:00.000")});
     auto answering = phoneSim(phone, kAnswering, "answer");
     auto silent = phoneSim(quiet, kSilent, "silent");
+    auto stranger = phoneSim(other, kStranger, "answer", {"--openid", "another-open"});
     auto service = startService();
     writeAccount(kOpenId, "13912345678");
 
@@ -174,10 +178,16 @@ TEST_F(PreconnectE2E, SilentPhoneIsGivenUpAfterTwoTriesWhileAnotherIsHeld) {
     ASSERT_TRUE(service->waitForOutput(kFailed + kSilentKey, 20s)) << service->output();
     ASSERT_TRUE(service->waitForOutput(kFailed + kSilentKey, 20s, service->output().find(kFailed + kSilentKey) + 1))
         << service->output();
+    EXPECT_TRUE(service->waitForOutput("mobile device openId is different of PC", 1s)) << service->output();
     // A third try would follow the scheduler's next tick.
-    const auto tried = silent->output().size();
-    EXPECT_FALSE(silent->waitForOutput("SIM TCP_REQUEST", 5s, tried)) << silent->output();
+    const auto silentTried = silent->output().size();
+    const auto strangerTried = stranger->output().size();
+    EXPECT_FALSE(silent->waitForOutput("SIM TCP_REQUEST", 5s, silentTried)) << silent->output();
+    EXPECT_FALSE(stranger->waitForOutput("SIM TCP_REQUEST", 1s, strangerTried)) << stranger->output();
     EXPECT_EQ(count(silent->output(), "SIM TCP_REQUEST"), 2u) << silent->output();
+    const auto strangerTries = count(stranger->output(), "SIM TCP_REQUEST");
+    EXPECT_GE(strangerTries, 1u);
+    EXPECT_LE(strangerTries, 2u) << stranger->output();
     EXPECT_EQ(count(answering->output(), "SIM TCP_ANSWERED 23"), 1u) << answering->output();
 }
 
