@@ -69,6 +69,17 @@ std::unique_ptr<StubPcSuite> LabTest::startPcSuite() {
     return stub;
 }
 
+std::unique_ptr<StubPcSuite> LabTest::startConnectCenter() {
+    std::unique_ptr<StubPcSuite> stub;
+    EXPECT_TRUE(NetNsLab::runIn(pc.ns, [&] { stub = std::make_unique<StubPcSuite>("0.0.0.0", 9300); }));
+    if (!stub) return stub;
+    stub->setDefaultAnswer({200, R"({"code":0})"});
+    const std::filesystem::path ini = root + "/Library/Preferences/pcsuite/switch_host.ini";
+    std::filesystem::create_directories(ini.parent_path());
+    std::ofstream(ini) << "[host]\nConnectionCenterHost=http://127.0.0.1:" << stub->port() << "\n";
+    return stub;
+}
+
 void LabTest::writeAccount(const std::string& openId, const std::string& phone, const std::string& token) {
     const std::string folder = home + "/Library/Application Support/pcsuite/DataBase";
     std::filesystem::create_directories(folder);

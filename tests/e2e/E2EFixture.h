@@ -41,6 +41,10 @@ protected:
     std::unique_ptr<ServiceProcess> startService();
     // A stand-in for the PC suite's HTTP server on every address of the PC node, port 9199.
     std::unique_ptr<StubPcSuite> startPcSuite();
+    // A stand-in for the cloud connect center in the PC node (port 9300, every address, each
+    // path answered {"code":0} unless set), named in switch_host.ini so that a service started
+    // afterwards sends its connect-center requests there.
+    std::unique_ptr<StubPcSuite> startConnectCenter();
     // Writes the PC suite's account database anew with one signed-in user.
     void writeAccount(const std::string& openId, const std::string& phone, const std::string& token = "tok");
 
