@@ -113,6 +113,7 @@ public:
     void onEvent(const phonesim::Listener::Event& event) {
         const auto now = Clock::now();
         std::lock_guard<std::mutex> lock(mutex_);
+        if (event.kind == phonesim::Listener::Event::Kind::Accepted) ++accepted_;
         if (event.kind == phonesim::Listener::Event::Kind::Answered && event.tag == 23) answered_ = now;
         if (event.kind == phonesim::Listener::Event::Kind::Request)
             frames_.emplace_back(kesu::phoneFrameTag(event.body).value_or(-1), now);
@@ -122,6 +123,11 @@ public:
     std::optional<Clock::time_point> answered() {
         std::lock_guard<std::mutex> lock(mutex_);
         return answered_;
+    }
+    // Whether the phone has taken a link in, waiting up to `timeout` for it.
+    bool accepted(std::chrono::milliseconds timeout) {
+        std::unique_lock<std::mutex> lock(mutex_);
+        return changed_.wait_for(lock, timeout, [&] { return accepted_ > 0; });
     }
     // When the next frame tagged `tag` arrived (frames before it are dropped); nullopt when
     // none came in time.
@@ -141,6 +147,7 @@ public:
 private:
     std::mutex mutex_;
     std::condition_variable changed_;
+    int accepted_ = 0;
     std::optional<Clock::time_point> answered_;
     std::deque<std::pair<int, Clock::time_point>> frames_;
 };
@@ -343,7 +350,7 @@ int run(const test::NetNsLab::Node& pc, const test::NetNsLab::Node& phone, int s
 
     // Round trips, interleaved: the raw echo's, then a held link's (the phones in turn).
     RawEcho echo(phone.ip, echoPhone->port());
-    if (!echo.ok()) {
+    if (!echo.ok() || !echoLog.accepted(5s)) {
         std::fprintf(stderr, "the raw echo could not dial the baseline's phone\n");
         return 1;
     }
