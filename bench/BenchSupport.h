@@ -1,6 +1,6 @@
 // Pieces shared by the benchmarks: percentiles, a phone's announcement as it travels on the
-// LAN, and the real service with its control API client, started in network namespaces by
-// the tests' own helpers (tests/support).
+// LAN, the real service with its control API client, started in network namespaces by
+// the tests' own helpers (tests/support), and the figures /proc gives about a process.
 #pragma once
 
 #include <httplib.h>
