@@ -1,10 +1,12 @@
 // Pieces shared by the benchmarks: percentiles, a phone's announcement as it travels on the
-// LAN, and the real service with its control API client, started in network namespaces by
-// the tests' own helpers (tests/support).
+// LAN, the real service with its control API client, started in network namespaces by
+// the tests' own helpers (tests/support), and the figures /proc gives about a process.
 #pragma once
 
 #include <httplib.h>
+#include <dirent.h>
 #include <signal.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cstdlib>
@@ -16,6 +18,7 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <utility>
@@ -66,7 +69,12 @@ inline std::string controlBody(const std::string& event, const Json& args = Json
 // written to $KESU_BENCH_LOG when that is set.
 class BenchService {
 public:
-    explicit BenchService(const std::string& netns) {
+    explicit BenchService(const std::string& netns) : BenchService(netns, nullptr) {}
+    // Starts the service once `prepare` has laid out the files it reads at start-up below its
+    // HOME and KESU_ROOT (the account database, the connect-center override).
+    BenchService(const std::string& netns,
+                 const std::function<void(const std::string& home, const std::string& root)>& prepare) {
+        if (prepare) prepare(home(), root());
         try {
             process_ = std::make_unique<test::ServiceProcess>(
                 KESU_BINARY, std::vector<std::string>{},
@@ -85,6 +93,10 @@ public:
         if (const char* log = std::getenv("KESU_BENCH_LOG")) std::ofstream(log) << process_->output();
     }
     pid_t pid() const { return process_ ? process_->pid() : -1; }
+    std::string home() const { return dir_.str() + "/home"; }
+    std::string root() const { return dir_.str() + "/root"; }
+    // The running child (its output), or null when it could not be started.
+    test::ServiceProcess* process() { return process_.get(); }
 
     // Waits (bounded, 10 s) until the control API answers.
     bool waitUntilUp() {
@@ -129,5 +141,120 @@ inline int runInLab(const char* bench, const std::vector<std::pair<std::string, 
     test::NetNsLab::runIn(made.front().ns, [&] { status = body(made); });
     return status;
 }
+
+// What /proc tells about a running process: the figures the idle measurements compare.
+namespace proc {
+
+inline std::string readText(const std::string& path) {
+    std::ifstream in(path);
+    std::ostringstream out;
+    out << in.rdbuf();
+    return out.str();
+}
+
+// The number after "key:" in a /proc status text (read with a leading line break), or -1.
+inline long long statusField(const std::string& status, const std::string& key) {
+    const auto at = status.find("\n" + key + ":");
+    if (at == std::string::npos) return -1;
+    return std::atoll(status.c_str() + at + key.size() + 2);
+}
+
+// A /proc status file with a line break before its first line, so that every field follows one.
+inline std::string statusText(const std::string& path) {
+    std::string text = readText(path);
+    text.insert(text.begin(), '\n');
+    return text;
+}
+
+inline std::vector<std::string> tasks(pid_t pid) {
+    std::vector<std::string> out;
+    const std::string dir = "/proc/" + std::to_string(pid) + "/task";
+    if (DIR* d = ::opendir(dir.c_str())) {
+        while (dirent* e = ::readdir(d))
+            if (e->d_name[0] != '.') out.push_back(dir + "/" + e->d_name);
+        ::closedir(d);
+    }
+    return out;
+}
+
+inline std::string trimmed(std::string s) {
+    while (!s.empty() && (s.back() == '\n' || s.back() == ' ')) s.pop_back();
+    return s;
+}
+
+// The service's own process: `pid` itself, or the first descendant that runs the service
+// binary (when the launcher starts it behind a helper process).
+inline pid_t serviceProcess(pid_t pid) {
+    std::vector<pid_t> todo{pid};
+    for (std::size_t next = 0; next < todo.size(); ++next) {
+        const pid_t p = todo[next];
+        if (trimmed(readText("/proc/" + std::to_string(p) + "/comm")) == "KesuConnService") return p;
+        for (const std::string& task : tasks(p)) {
+            std::istringstream children(readText(task + "/children"));
+            for (pid_t c; children >> c;) todo.push_back(c);
+        }
+    }
+    return pid;
+}
+
+struct Usage {
+    Clock::time_point at;
+    long long switches = 0;  // voluntary + involuntary, summed over the live threads
+    double cpuSeconds = 0;   // utime + stime of the whole process
+    long long threads = 0;
+    long long rssKiB = 0;
+    std::map<std::string, int> names;  // thread name -> count
+};
+
+inline Usage usage(pid_t pid) {
+    Usage u;
+    u.at = Clock::now();
+    const std::string dir = "/proc/" + std::to_string(pid);
+    const std::string status = statusText(dir + "/status");
+    u.threads = statusField(status, "Threads");
+    u.rssKiB = statusField(status, "VmRSS");
+    for (const std::string& task : tasks(pid)) {
+        const std::string ts = statusText(task + "/status");
+        u.switches += statusField(ts, "voluntary_ctxt_switches") + statusField(ts, "nonvoluntary_ctxt_switches");
+        ++u.names[trimmed(readText(task + "/comm"))];
+    }
+    // Fields 14 and 15 of stat, counted after the parenthesised command name.
+    const std::string stat = readText(dir + "/stat");
+    const auto close = stat.rfind(')');
+    if (close == std::string::npos || close + 2 > stat.size()) return u;
+    std::istringstream rest(stat.substr(close + 2));
+    std::string field;
+    unsigned long long utime = 0, stime = 0;
+    for (int i = 3; i <= 15 && rest >> field; ++i) {
+        if (i == 14) utime = std::stoull(field);
+        if (i == 15) stime = std::stoull(field);
+    }
+    u.cpuSeconds = static_cast<double>(utime + stime) / static_cast<double>(::sysconf(_SC_CLK_TCK));
+    return u;
+}
+
+// The rates between two readings of the same process.
+struct Rates {
+    double seconds = 0;
+    double cpuPerSecond = 0;
+    double switchesPerSecond = 0;
+    long long threads = 0;
+    double rssMiB = 0;
+    std::map<std::string, int> names;
+};
+
+inline Rates between(const Usage& first, const Usage& last) {
+    Rates r;
+    r.seconds = std::chrono::duration<double>(last.at - first.at).count();
+    if (r.seconds <= 0) return r;
+    r.cpuPerSecond = (last.cpuSeconds - first.cpuSeconds) / r.seconds;
+    r.switchesPerSecond = static_cast<double>(last.switches - first.switches) / r.seconds;
+    r.threads = last.threads;
+    r.rssMiB = static_cast<double>(last.rssKiB) / 1024.0;
+    r.names = last.names;
+    return r;
+}
+
+}  // namespace proc
 
 }  // namespace kesu::bench

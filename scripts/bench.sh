@@ -14,6 +14,7 @@ quick_args() {
     connect_bench) echo "30 5" ;;
     control_bench) echo "200 1" ;;
     idle_bench) echo "--seconds=2 --settle=1" ;;
+    preconnect_bench) echo "--seconds=10 --settle=3 --trips=50" ;;
     runtime_bench) echo "2" ;;
     ssdp_bench) echo "--benchmark_min_time=0.01" ;;
   esac
