@@ -1,5 +1,7 @@
 #include "app/ServiceManager.h"
 
+#include "account/DataInstance.h"
+
 #include "connect/PcsuiteInterface.h"
 #include "connect/SocketServer.h"
 #include "core/Config.h"
@@ -58,6 +60,13 @@ void ServiceManager::start() {
                     std::make_shared<RestartServiceSubscriber>(loop_),
                     std::make_shared<SystemEventSubscriber>(loop_)};
     for (const auto& subscriber : subscribers_) EventPublisher::instance().addObserver(subscriber);
+    // The first account read announced itself before anyone listened: a service that starts
+    // signed in reports the PC and fetches the account's device list now, as on a PC suite
+    // event, not only at the next account, network or PC suite event.
+    if (!dataInstance().get(&databaseParam::openid).empty()) {
+        Log::mPrintlog("[Server Start] signed in at start, report the PC and fetch the device list");
+        EventPublisher::instance().notifySubscribers(ServiceEvent::Pcsuite);
+    }
     eventDetected_ = std::make_unique<EventDetected>(loop_);
 }
 

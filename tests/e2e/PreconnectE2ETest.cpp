@@ -137,6 +137,16 @@ TEST_F(PreconnectE2E, SignInPreconnectsTheListedPhoneWhichThenAsksToBeConnected)
         << bodies[2];
 }
 
+// A service that starts signed in (after a reboot, say) fetches the list and pre-connects
+// without waiting for the next account or network event.
+TEST_F(PreconnectE2E, StartingSignedInPreconnectsWithoutAnotherEvent) {
+    listPhones({listed(phone, kAnswering, "2026-12-06 10:00:00.000")});
+    auto sim = phoneSim(phone, kAnswering, "answer");
+    writeAccount(kOpenId, "13912345678");
+    auto service = startService();
+    ASSERT_TRUE(service->waitForOutput(kSuccess + kAnsweringKey, 15s)) << service->output() << sim->output();
+}
+
 // A phone that drops its link is torn down and reported, then held again while it listens;
 // once it is gone for good the scan shows it listed but not held.
 TEST_F(PreconnectE2E, DroppedLinkIsTornDownAndTakenUpAgain) {
