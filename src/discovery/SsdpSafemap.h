@@ -39,6 +39,8 @@ public:
     // Removes every entry not heard for longer than the expiry (an entry exactly at the
     // expiry stays); true when at least one went.
     bool eraseTimeOut();
+    // How long an entry stays after it was last heard.
+    SteadyClock::duration expiry() const { return expiry_; }
     // When the entry heard longest ago passes the expiry (the next sweep that removes
     // something); nullopt for an empty table.
     std::optional<SteadyClock::time_point> nextExpiry() const;

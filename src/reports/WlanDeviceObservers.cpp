@@ -91,14 +91,16 @@ struct WlanDeviceDelete::Sweep : std::enable_shared_from_this<Sweep> {
         });
     }
     // A device is about to be stored (the hook runs before the table changes, perhaps on
-    // another thread): an idle sweep starts again. The table may still look empty here, so
-    // then the sweep looks again one period later.
+    // another thread): an idle sweep starts again. The table may still look empty here; the
+    // device heard now expires one expiry from now, so the sweep looks again just after that.
     void deviceHeard() {
         if (stopped || armed) return;
         if (manager.ssdpDeviceMap.nextExpiry()) {
             schedule();
         } else {
-            arm(period);
+            const auto untilExpiry =
+                std::chrono::ceil<std::chrono::milliseconds>(manager.ssdpDeviceMap.expiry()) + std::chrono::milliseconds(1);
+            arm(std::clamp(untilExpiry, std::chrono::milliseconds(1), period));
         }
     }
     void stop() {
