@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 #include <net/if.h>
 
-#include <condition_variable>
 #include <future>
 #include <mutex>
 #include <thread>
@@ -23,43 +22,6 @@ namespace kesu {
 namespace {
 
 using namespace std::chrono_literals;
-
-struct Heard {
-    std::string data;
-    std::string host;
-};
-
-// Keeps what a socket hears (classified when asked to); waits for the n-th datagram.
-class Recorder {
-public:
-    explicit Recorder(bool classify) : classify_(classify) {}
-    SsdpSocket::Receiver receiver() {
-        return [this](std::string_view data, const std::string& host, std::uint16_t) {
-            if (classify_) SsdpMessage::handleDatagram(data, host);
-            std::lock_guard<std::mutex> l(m_);
-            heard_.push_back({std::string(data), host});
-            cv_.notify_all();
-        };
-    }
-    // Waits until `count` datagrams from senders other than `except` arrived; those ones.
-    std::vector<Heard> waitFor(std::size_t count, const std::string& except = "") {
-        std::unique_lock<std::mutex> l(m_);
-        std::vector<Heard> picked;
-        cv_.wait_for(l, 10s, [&] {
-            picked.clear();
-            for (const Heard& h : heard_)
-                if (h.host != except) picked.push_back(h);
-            return picked.size() >= count;
-        });
-        return picked;
-    }
-
-private:
-    const bool classify_;
-    std::mutex m_;
-    std::condition_variable cv_;
-    std::vector<Heard> heard_;
-};
 
 // A phone's announcement in the current format.
 std::string phoneAnnouncement(const std::string& id, const std::string& name) {
@@ -113,7 +75,7 @@ protected:
 TEST_F(SsdpSocketTest, LoopbackDatagramsReachTheTableAndTheQueryAnswer) {
     env.config().ssdpPort = test::freeUdpPort();
     env.config().ssdpMaxDatagram = 1024;
-    Recorder pcHeard(/*classify=*/true);
+    test::Recorder pcHeard(&SsdpDeviceManager::instance());
     SsdpSocketManager pc(loop, pcHeard.receiver());
     EXPECT_FALSE(pc.sendResponseData("n", "id", "acc", "open", "svc"));  // no socket yet
     pc.createSocket("lo");
@@ -177,7 +139,7 @@ TEST_F(SsdpSocketTest, FailedSetUpIsLoggedAndLeavesASocketThatNeitherHearsNorSen
 // closed from its own receiver (on the loop).
 TEST_F(SsdpSocketTest, SharedPortRebuildsAndCloseFromAnyThread) {
     env.config().ssdpPort = test::freeUdpPort();
-    Recorder keeper(false);
+    test::Recorder keeper;
     SsdpSocket listener(loop, "lo", keeper.receiver());  // stays up across the rebuilds
     ASSERT_TRUE(listener.isReceiving());
 
@@ -258,8 +220,8 @@ TEST_F(SsdpSocketTest, NetnsEachAdapterSocketHearsAndSpeaksOnlyOnItsOwnNetwork) 
     NetnsLab lab;
     if (const std::string failed = lab.up(); !failed.empty()) GTEST_SKIP() << failed;
     // The real discovery port: nothing else listens inside these namespaces.
-    Recorder pcA(true), pcB(true), phoneA(false), phoneB(false);
-    auto socketOn = [&](const std::string& role, const std::string& netCard, Recorder& recorder) {
+    test::Recorder pcA(&SsdpDeviceManager::instance()), pcB(&SsdpDeviceManager::instance()), phoneA, phoneB;
+    auto socketOn = [&](const std::string& role, const std::string& netCard, test::Recorder& recorder) {
         return lab.inside(role, [&] { return std::make_unique<SsdpSocket>(loop, netCard, recorder.receiver()); });
     };
     auto pcSocketA = socketOn("pc", "kf-a0", pcA);
