@@ -1,6 +1,5 @@
 // The adapter monitor over the fake platform: events and socket rebuilds, the silent-network
 // rebuild, announcing on loopback, the rebuild pause and the discovery start-up's stop.
-#include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <asio/steady_timer.hpp>
@@ -8,11 +7,8 @@
 
 #include "DiscoveryFixture.h"
 #include "core/EventLoop.h"
-#include "core/Json.h"
 #include "discovery/KesuAdapterManager.h"
 #include "discovery/ServiceWorker.h"
-#include "discovery/SsdpDeviceManager.h"
-#include "discovery/SsdpMessage.h"
 #include "support/NetNs.h"
 #include "unit/events/EventRecorder.h"
 #include "platform/SystemInfo.h"
@@ -69,32 +65,28 @@ TEST_F(AdapterMonitor, AdapterChangesGiveTheirEventsAndRebuildOnlyTheirSockets) 
         Events events;
         Names sockets, rebuilt, kept;
     };
+    const std::string change = "NetworkChangeEvent", wiredOff = "WiredNetDisconnectEvent",
+                      wiredOn = "WiredNetConnectEvent", wlanOff = "WlanNetDisconnectEvent", wlanOn = "WlanNetConnectEvent";
+    const Names both{"kf-eth0", "kf-wlan0"}, wlanOnly{"kf-wlan0"}, ethOnly{"kf-eth0"};
     const std::vector<Step> steps = {
-        {{kWlan, kEth}, true, {"WifiOpenEvent"}, {"kf-eth0", "kf-wlan0"}, {}, {"kf-eth0", "kf-wlan0"}},
-        {{kWlan, kEth}, true, {}, {"kf-eth0", "kf-wlan0"}, {}, {"kf-eth0", "kf-wlan0"}},
-        {{kWlan}, true, {"NetworkChangeEvent", "WiredNetDisconnectEvent"}, {"kf-wlan0"}, {"kf-eth0"}, {}},
-        {{kWlan, kEth}, true, {"NetworkChangeEvent", "WiredNetConnectEvent"}, {"kf-eth0", "kf-wlan0"}, {}, {}},
-        {{wlan9, kEth}, true, {"NetworkChangeEvent", "WlanNetDisconnectEvent", "WlanNetConnectEvent"},
-         {"kf-eth0", "kf-wlan0"}, {"kf-wlan0"}, {"kf-eth0"}},
+        {{kWlan, kEth}, true, {"WifiOpenEvent"}, both, {}, both},
+        {{kWlan, kEth}, true, {}, both, {}, both},
+        {{kWlan}, true, {change, wiredOff}, wlanOnly, ethOnly, {}},
+        {{kWlan, kEth}, true, {change, wiredOn}, both, {}, {}},
+        {{wlan9, kEth}, true, {change, wlanOff, wlanOn}, both, wlanOnly, ethOnly},
         // Losing the address keeps the adapter and a socket on it; getting one back connects.
-        {{wlan9, {"Ethernet", "kf-eth0", ""}}, true, {"NetworkChangeEvent", "WiredNetDisconnectEvent"},
-         {"kf-eth0", "kf-wlan0"}, {}, {}},
-        {{wlan9, kEth}, true, {"NetworkChangeEvent", "WiredNetConnectEvent"}, {"kf-eth0", "kf-wlan0"}, {}, {}},
+        {{wlan9, {"Ethernet", "kf-eth0", ""}}, true, {change, wiredOff}, both, {}, {}},
+        {{wlan9, kEth}, true, {change, wiredOn}, both, {}, {}},
         // The radio goes off, the interface stays without its address; then it disappears too.
-        {{wlanNoIp, kEth}, false, {"WifiCloseEvent", "NetworkChangeEvent", "WlanNetDisconnectEvent"},
-         {"kf-eth0", "kf-wlan0"}, {}, {}},
-        {{kEth}, false, {"NetworkChangeEvent", "WlanNetDisconnectEvent"}, {"kf-eth0"}, {}, {}},
-        {{kWlan, kEth}, true, {"WifiOpenEvent", "NetworkChangeEvent", "WlanNetConnectEvent"},
-         {"kf-eth0", "kf-wlan0"}, {}, {}},
-        // Power and interface gone in the same check.
-        {{kEth}, false, {"WifiCloseEvent", "NetworkChangeEvent", "WlanNetDisconnectEvent"}, {"kf-eth0"}, {}, {}},
-        {{kWlan, kEth}, true, {"WifiOpenEvent", "NetworkChangeEvent", "WlanNetConnectEvent"},
-         {"kf-eth0", "kf-wlan0"}, {}, {}},
+        {{wlanNoIp, kEth}, false, {"WifiCloseEvent", change, wlanOff}, both, {}, {}},
+        {{kEth}, false, {change, wlanOff}, ethOnly, {}, {}},
+        {{kWlan, kEth}, true, {"WifiOpenEvent", change, wlanOn}, both, {}, {}},
+        {{kEth}, false, {"WifiCloseEvent", change, wlanOff}, ethOnly, {}, {}},  // power and interface at once
+        {{kWlan, kEth}, true, {"WifiOpenEvent", change, wlanOn}, both, {}, {}},
         // The socket follows its adapter to another interface; with the same address no event.
-        {{kWlan, eth1}, true, {"NetworkChangeEvent", "WiredNetDisconnectEvent", "WiredNetConnectEvent"},
-         {"kf-eth1", "kf-wlan0"}, {"kf-eth0"}, {"kf-wlan0"}},
+        {{kWlan, eth1}, true, {change, wiredOff, wiredOn}, {"kf-eth1", "kf-wlan0"}, ethOnly, wlanOnly},
         {{kWlan, eth2}, true, {}, {"kf-eth2", "kf-wlan0"}, {}, {}},
-        {{kWlan}, true, {"NetworkChangeEvent", "WiredNetDisconnectEvent"}, {"kf-wlan0"}, {}, {}},
+        {{kWlan}, true, {change, wiredOff}, wlanOnly, {}, {}},
     };
     for (std::size_t i = 0; i < steps.size(); ++i) {
         SCOPED_TRACE("step " + std::to_string(i));

@@ -1,17 +1,11 @@
 // The discovered-device table: map operations, the strict 30-second expiry on the monotonic
 // clock (wall-clock steps change nothing), the bound with eviction of the oldest entry, the
 // query answer, and concurrent use.
-#include <gtest/gtest.h>
 
 #include <memory>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include "DiscoveryFixture.h"
-#include "core/Json.h"
-#include "discovery/SsdpDeviceManager.h"
-#include "discovery/SsdpMessage.h"
 #include "discovery/SsdpSafemap.h"
 
 namespace kesu {

@@ -1,18 +1,10 @@
 // Discovery datagrams: wire texts, strict base64, masking and ids, both parsers,
 // classification of received datagrams and insertion into the table.
-#include <gtest/gtest.h>
 
-#include <string>
 #include <tuple>
-#include <vector>
 
 #include "DiscoveryFixture.h"
-#include "core/Json.h"
-#include "discovery/Base64.h"
-#include "discovery/SsdpDeviceManager.h"
-#include "discovery/SsdpMessage.h"
 #include "core/Text.h"
-#include "core/WallClock.h"
 #include "platform/SystemInfo.h"
 
 namespace kesu {

@@ -1,19 +1,14 @@
 // The discovery sockets with real datagrams on loopback, and across network namespaces
 // (one socket per adapter hears and speaks only on its own network).
-#include <gtest/gtest.h>
 #include <net/if.h>
 
 #include <future>
-#include <mutex>
 #include <thread>
 #include <tuple>
 
 #include "DiscoveryFixture.h"
 #include "core/EventLoop.h"
 #include "discovery/KesuAdapterManager.h"
-#include "discovery/SsdpDeviceManager.h"
-#include "discovery/SsdpMessage.h"
-#include "discovery/SsdpSocket.h"
 #include "discovery/SsdpSocketManager.h"
 #include "support/NetNs.h"
 #include "platform/SystemInfo.h"
