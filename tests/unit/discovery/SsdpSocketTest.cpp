@@ -4,7 +4,6 @@
 
 #include <future>
 #include <thread>
-#include <tuple>
 
 #include "DiscoveryFixture.h"
 #include "core/EventLoop.h"
@@ -181,23 +180,18 @@ public:
 
     // Empty when the lab is up, else what failed.
     std::string up() {
-        const std::string pc = "-n " + ns("pc") + " ";
-        std::vector<std::string> steps;
-        for (const char* role : {"pc", "pa", "pb"})
-            steps.insert(steps.end(), {"netns add " + ns(role), "-n " + ns(role) + " link set lo up"});
-        for (const auto& [side, pcIp, phoneIp] : {std::tuple{"a", "10.77.0.1", "10.77.0.2"},
-                                                  std::tuple{"b", "10.77.0.5", "10.77.0.6"}}) {
-            const std::string phone = "-n " + ns(std::string("p") + side) + " ", x0 = std::string("kf-") + side + "0",
-                              x1 = std::string("kf-") + side + "1";
-            steps.insert(steps.end(), {pc + "link add " + x0 + " type veth peer name " + x1 + " netns " +
-                                           ns(std::string("p") + side),
-                                       pc + "addr add " + pcIp + "/30 dev " + x0, phone + "addr add " + phoneIp +
-                                           "/30 dev " + x1, pc + "link set " + x0 + " up", phone + "link set " + x1 +
-                                           " up", phone + "route add 224.0.0.0/4 dev " + x1});
-        }
-        steps.push_back(pc + "route add 224.0.0.0/4 dev kf-a0");
-        for (const std::string& step : steps)
+        const std::string pc = "-n " + ns("pc") + " ", pa = "-n " + ns("pa") + " ", pb = "-n " + ns("pb") + " ";
+        for (const std::string& step :
+             {"netns add " + ns("pc"), "netns add " + ns("pa"), "netns add " + ns("pb"), pc + "link set lo up",
+              pa + "link set lo up", pb + "link set lo up",
+              pc + "link add kf-a0 type veth peer name kf-a1 netns " + ns("pa"),
+              pc + "link add kf-b0 type veth peer name kf-b1 netns " + ns("pb"), pc + "addr add 10.77.0.1/30 dev kf-a0",
+              pc + "addr add 10.77.0.5/30 dev kf-b0", pa + "addr add 10.77.0.2/30 dev kf-a1",
+              pb + "addr add 10.77.0.6/30 dev kf-b1", pc + "link set kf-a0 up", pc + "link set kf-b0 up",
+              pa + "link set kf-a1 up", pb + "link set kf-b1 up", pc + "route add 224.0.0.0/4 dev kf-a0",
+              pa + "route add 224.0.0.0/4 dev kf-a1", pb + "route add 224.0.0.0/4 dev kf-b1"}) {
             if (!test::NetNsLab::ip(step)) return "ip " + step + " failed";
+        }
         return "";
     }
 
