@@ -97,10 +97,8 @@ TEST_F(SystemInfoTest, MacAddressAndNetworkSnapshot) {
     fake->addAdapter("Wi-Fi", "wlan1", "bb:00:00:00:00:02", "192.168.7.9");
     const auto list = SystemInfo::GetNetworkInfoList();
     ASSERT_EQ(list.size(), 2u);
-    EXPECT_EQ(list[1], (std::map<std::string, std::string>{{"name", "Wi-Fi"},
-                                                           {"bsdName", "wlan1"},
-                                                           {"ip", "192.168.7.9"},
-                                                           {"netmask", "255.255.255.0"},
+    EXPECT_EQ(list[1], (std::map<std::string, std::string>{{"name", "Wi-Fi"}, {"bsdName", "wlan1"},
+                                                           {"ip", "192.168.7.9"}, {"netmask", "255.255.255.0"},
                                                            {"ssid", "Caf\xC3\xA9"}}));
     EXPECT_EQ(SystemInfo::getNetworkCorrespondAddress().at("Wi-Fi"), "192.168.7.9");
     EXPECT_EQ(SystemInfo::GetWifiName(), "wlan1");
