@@ -7,6 +7,8 @@
 
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -16,6 +18,9 @@
 #include "core/Log.h"
 #include "core/WallClock.h"
 #include "discovery/Base64.h"
+#include "discovery/SsdpDeviceManager.h"
+#include "discovery/SsdpMessage.h"
+#include "discovery/SsdpSocket.h"
 #include "platform/fake/FakePlatform.h"
 #include "support/TestSupport.h"
 #include "unit/UnitHelpers.h"
@@ -35,6 +40,42 @@ inline std::string announce(const Json& body) {
     return "RESPONSE * HTTP/1.1\r\nDATE:2024-05-01 10:00:00.000\r\ncompatGsonStr:" +
            base64::encode(json::compact(body)) + "\r\n";
 }
+
+// Keeps what a socket hears (classified into `table` when given); waits for the n-th datagram.
+class Recorder {
+public:
+    struct Heard {
+        std::string data, host;
+    };
+    explicit Recorder(SsdpDeviceManager* table = nullptr) : table_(table) {}
+    SsdpSocket::Receiver receiver() {
+        return [this](std::string_view data, const std::string& host, std::uint16_t) {
+            if (table_) SsdpMessage::handleDatagram(data, host, *table_);
+            std::lock_guard<std::mutex> l(m_);
+            heard_.push_back({std::string(data), host});
+            cv_.notify_all();
+        };
+    }
+    // Waits (10 s at most) for `count` datagrams starting with `prefix` from senders other
+    // than `except`; returns those heard.
+    std::vector<Heard> waitFor(std::size_t count, const std::string& except = "", const std::string& prefix = "") {
+        std::unique_lock<std::mutex> l(m_);
+        std::vector<Heard> picked;
+        cv_.wait_for(l, std::chrono::seconds(10), [&] {
+            picked.clear();
+            for (const Heard& h : heard_)
+                if (h.host != except && h.data.starts_with(prefix)) picked.push_back(h);
+            return picked.size() >= count;
+        });
+        return picked;
+    }
+
+private:
+    SsdpDeviceManager* const table_;
+    std::mutex m_;
+    std::condition_variable cv_;
+    std::vector<Heard> heard_;
+};
 
 // One adapter of the fake machine; an empty ip is an adapter without an address.
 struct Adapter {
