@@ -20,23 +20,19 @@ using DataGetTest = AccountFixture;
 // Fills the first page of `table` with garbage, leaving the schema page intact.
 void overwriteTablePage(const std::string& path, const std::string& table) {
     sqlite3* db = nullptr;
-    ASSERT_EQ(sqlite3_open(path.c_str(), &db), SQLITE_OK);
     sqlite3_stmt* stmt = nullptr;
-    sqlite3_prepare_v2(db, "SELECT rootpage FROM sqlite_master WHERE name = ?; ", -1, &stmt, nullptr);
+    ASSERT_EQ(sqlite3_open(path.c_str(), &db), SQLITE_OK);
+    sqlite3_prepare_v2(db, "SELECT rootpage, (SELECT page_size FROM pragma_page_size()) FROM sqlite_master WHERE name = ?;",
+                       -1, &stmt, nullptr);
     sqlite3_bind_text(stmt, 1, table.c_str(), -1, SQLITE_TRANSIENT);
-    ASSERT_EQ(sqlite3_step(stmt), SQLITE_ROW);
-    const int page = sqlite3_column_int(stmt, 0);
-    sqlite3_finalize(stmt);
-    sqlite3_prepare_v2(db, "PRAGMA page_size;", -1, &stmt, nullptr);
-    ASSERT_EQ(sqlite3_step(stmt), SQLITE_ROW);
-    const int pageSize = sqlite3_column_int(stmt, 0);
+    const bool found = sqlite3_step(stmt) == SQLITE_ROW;
+    const int page = found ? sqlite3_column_int(stmt, 0) : 0, pageSize = found ? sqlite3_column_int(stmt, 1) : 0;
     sqlite3_finalize(stmt);
     sqlite3_close(db);
     ASSERT_GT(page, 1);
     std::fstream file(path, std::ios::in | std::ios::out | std::ios::binary);
     file.seekp(static_cast<std::streamoff>(page - 1) * pageSize);
-    const std::string garbage(static_cast<std::size_t>(pageSize), '\xA5');
-    file.write(garbage.data(), static_cast<std::streamsize>(garbage.size()));
+    file << std::string(static_cast<std::size_t>(pageSize), '\xA5');
 }
 
 TEST_F(DataGetTest, PathsFollowTheHomeFolderWithoutASandbox) {

@@ -9,7 +9,7 @@
 #include <nlohmann/json.hpp>
 
 #include <cstdint>
-#include <functional>
+#include <optional>
 
 #include "account/DataGet.h"
 #include "core/EventLoop.h"
@@ -152,35 +152,26 @@ TEST_F(FileMonitorTest, BadFilesKeepTheServiceGoingAndAreLoggedOncePerChange) {
     env.config().databaseBusyTimeout = 0ms;
     const std::string untyped = "CREATE TABLE User (openid, phone, token);"
                                 "CREATE TABLE SoftwareSet (openid, configDir, storageDir);";
+    std::string junk(8192, '\0');
+    std::uint32_t x = 2463534242u;
+    for (char& c : junk) c = static_cast<char>(x ^= x << 13, x ^= x >> 17, x ^= x << 5);
     struct Case {
         const char* name;
-        std::function<void()> make;
+        std::optional<std::string> script;  // SQL run on a new file; else raw `bytes`; neither: no file
+        std::optional<std::string> bytes;
         DatabaseState state;
         std::string openid;
     };
     const Case cases[] = {
-        {"missing", [&] { std::filesystem::remove(dbFile()); }, DatabaseState::Missing, ""},
-        {"empty", [&] { writeSupportFile("DataBase/Config.db", ""); }, DatabaseState::Unreadable, "oid-1"},
-        {"random bytes",
-         [&] {
-             std::string junk(8192, '\0');
-             std::uint32_t x = 2463534242u;
-             for (char& c : junk) c = static_cast<char>(x ^= x << 13, x ^= x >> 17, x ^= x << 5);
-             writeSupportFile("DataBase/Config.db", junk);
-         },
-         DatabaseState::Unreadable, "oid-1"},
-        {"no User table", [&] { writeDatabaseScript(dbFile(), "CREATE TABLE Other (x TEXT);"); },
-         DatabaseState::Unreadable, "oid-1"},
-        {"User without the columns", [&] { writeDatabaseScript(dbFile(), "CREATE TABLE User (name TEXT);"); },
-         DatabaseState::Unreadable, "oid-1"},
-        {"integer open id", [&] { writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (12345, 1, 2.5);"); },
-         DatabaseState::Good, "12345"},
-        {"blob not text", [&] { writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (X'FF00FE', X'00', 'tok');"); },
-         DatabaseState::Good, ""},
-        {"blob text", [&] { writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (X'6F69642D62', NULL, NULL);"); },
-         DatabaseState::Good, "oid-b"},
-        {"NULLs", [&] { writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (NULL, NULL, NULL);"); },
-         DatabaseState::Good, ""},
+        {"missing", {}, {}, DatabaseState::Missing, ""},
+        {"empty", {}, "", DatabaseState::Unreadable, "oid-1"},
+        {"random bytes", {}, junk, DatabaseState::Unreadable, "oid-1"},
+        {"no User table", "CREATE TABLE Other (x TEXT);", {}, DatabaseState::Unreadable, "oid-1"},
+        {"User without the columns", "CREATE TABLE User (name TEXT);", {}, DatabaseState::Unreadable, "oid-1"},
+        {"integer open id", untyped + "INSERT INTO User VALUES (12345, 1, 2.5);", {}, DatabaseState::Good, "12345"},
+        {"blob not text", untyped + "INSERT INTO User VALUES (X'FF00FE', X'00', 'tok');", {}, DatabaseState::Good, ""},
+        {"blob text", untyped + "INSERT INTO User VALUES (X'6F69642D62', NULL, NULL);", {}, DatabaseState::Good, "oid-b"},
+        {"NULLs", untyped + "INSERT INTO User VALUES (NULL, NULL, NULL);", {}, DatabaseState::Good, ""},
     };
 
     std::time_t stamp = 1'700'000'000;
@@ -198,7 +189,9 @@ TEST_F(FileMonitorTest, BadFilesKeepTheServiceGoingAndAreLoggedOncePerChange) {
         SCOPED_TRACE(c.name);
         const bool bad = c.state != DatabaseState::Good;
         const int linesBefore = stateLines();
-        c.make();
+        if (c.script) writeDatabaseScript(dbFile(), *c.script);
+        else if (c.bytes) writeSupportFile("DataBase/Config.db", *c.bytes);
+        else std::filesystem::remove(dbFile());
         if (std::filesystem::exists(dbFile())) setModified(dbFile(), ++stamp);
         monitor.runPass();
         EXPECT_EQ(monitor.state(), c.state);
