@@ -62,9 +62,11 @@ protected:
         loop.start();
     }
 
+    // A started LAN reporter woken by the table's change rule.
     std::shared_ptr<WlanReportDevices> lanReporter() {
         auto reporter = std::make_shared<WlanReportDevices>(table);
         reporter->start(loop);
+        compare.addObserver(reporter);
         return reporter;
     }
 
@@ -94,14 +96,13 @@ protected:
 
     test::StubPcSuite pcsuite;
     SsdpDeviceManager table{64, 30.0, clock};
+    WlanDetectedDeviceCompare compare{table};
     EventLoop loop;
 };
 
 TEST_F(DeviceReportsTest, OnlyNewDevicesAndAccountGuideOpenIdChangesCount) {
     env.config().reportDelay = 1h;  // nothing is sent: a waiting report shows a notification
-    WlanDetectedDeviceCompare compare(table);
     auto reporter = lanReporter();
-    compare.addObserver(reporter);
     auto notified = [&] {
         const bool waiting = !reporter->waitIdle(0ms);
         reporter->cancel();
@@ -136,9 +137,7 @@ TEST_F(DeviceReportsTest, OnlyNewDevicesAndAccountGuideOpenIdChangesCount) {
 TEST_F(DeviceReportsTest, BurstGoesAsOneListAndTheThrottleHoldsTheNext) {
     env.config().reportDelay = 300ms;
     env.config().reportThrottle = 1h;
-    WlanDetectedDeviceCompare compare(table);
     auto reporter = lanReporter();
-    compare.addObserver(reporter);
 
     hear(phoneBody("bbbb"), "10.0.0.2");
     hear(phoneBody("aaaa"), "10.0.0.1");
@@ -157,9 +156,7 @@ TEST_F(DeviceReportsTest, BurstGoesAsOneListAndTheThrottleHoldsTheNext) {
 TEST_F(DeviceReportsTest, ChangeWhileAListIsPostedGetsAFollowUp) {
     env.config().reportThrottle = 200ms;
     pcsuite.queueAnswer(kLanPath, {200, R"({"code":"000000"})", "application/json", 700ms});
-    WlanDetectedDeviceCompare compare(table);
     auto reporter = lanReporter();
-    compare.addObserver(reporter);
 
     hear(phoneBody("aaaa"), "10.0.0.1");
     ASSERT_TRUE(reports(1, 10s)) << seen();  // its answer is still held back
@@ -236,10 +233,8 @@ TEST_F(DeviceReportsTest, PreconnectListPostsEveryEntry) {
 }
 
 TEST_F(DeviceReportsTest, ReannouncedDeviceIsReportedOnceThenOnceMoreWhenItExpires) {
-    WlanDetectedDeviceCompare compare(table);
     WlanDeviceDelete expiry(loop, table);
     auto reporter = lanReporter();
-    compare.addObserver(reporter);
     expiry.addObserver(reporter);
     expiry.detectedToDelete(env.config().expirySweepPeriod);
 
