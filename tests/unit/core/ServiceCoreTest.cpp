@@ -65,14 +65,12 @@ TEST_F(RestartRule, RestartsAfterMoreThanSevenWholeDaysOfAUsableVersionFile) {
     EventLoop loop;
     RestartServiceSubscriber subscriber(loop);
     versionUpdated("2026-11-26 10:00:00.000");
-    now("2026-12-03 10:00:00.000");  // exactly 7 days
-    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
-    now("2026-12-04 09:59:59.999");  // 7 days and almost 24 hours
-    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
-    now("2026-12-04 10:00:00.000");  // 8 days
-    EXPECT_TRUE(subscriber.connServiceRunOutOfDate());
-    now("2026-11-01 10:00:00.000");  // a version file from the future
-    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
+    // Exactly 7 days, 7 days and almost 24 hours, 8 days, a version file from the future.
+    for (const auto& [time, outOfDate] : {std::pair{"2026-12-03 10:00:00.000", false}, {"2026-12-04 09:59:59.999", false},
+                                          {"2026-12-04 10:00:00.000", true}, {"2026-11-01 10:00:00.000", false}}) {
+        now(time);
+        EXPECT_EQ(subscriber.connServiceRunOutOfDate(), outOfDate) << time;
+    }
 
     // A missing or unusable version file counts as current.
     now("2026-12-04 10:00:00.000");
