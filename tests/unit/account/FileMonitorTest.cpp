@@ -9,7 +9,7 @@
 #include <nlohmann/json.hpp>
 
 #include <cstdint>
-#include <functional>
+#include <optional>
 
 #include "account/DataGet.h"
 #include "core/EventLoop.h"
@@ -22,6 +22,10 @@ namespace kesu::test {
 namespace {
 
 using namespace std::chrono_literals;
+
+// Moves the signed-in account's rows to a new open id and token.
+constexpr const char* kSwitchAccount = "UPDATE User SET openid = 'oid-2', token = 'tok-2';"
+                                       "UPDATE SoftwareSet SET openid = 'oid-2' WHERE openid = 'oid-1';";
 
 class FileMonitorTest : public AccountFixture {
 protected:
@@ -52,8 +56,17 @@ protected:
     }
 
     int changes() { return events->count("AccountChangeEvent"); }
-    void writeBytes(const std::string& bytes) {
-        env.dir().write("home/Library/Application Support/pcsuite/DataBase/Config.db", bytes);
+    static std::string openid() { return dataInstance().get().openid; }
+    // A writer that ran `script` on Config.db and now holds it in an exclusive transaction.
+    sqlite3* lockedWriter(const std::string& script) {
+        sqlite3* writer = nullptr;
+        EXPECT_EQ(sqlite3_open(dbFile().c_str(), &writer), SQLITE_OK);
+        EXPECT_EQ(sqlite3_exec(writer, (script + "BEGIN EXCLUSIVE;").c_str(), nullptr, nullptr, nullptr), SQLITE_OK);
+        return writer;
+    }
+    static void unlock(sqlite3* writer) {
+        EXPECT_EQ(sqlite3_exec(writer, "ROLLBACK;", nullptr, nullptr, nullptr), SQLITE_OK);
+        sqlite3_close(writer);
     }
     // A datagram already queued (loopback delivers during the send), if any.
     std::optional<std::string> sent() { return pushClient.receive(0ms); }
@@ -68,107 +81,97 @@ TEST_F(FileMonitorTest, PassesFollowTheDatabaseFile) {
     setModified(dbFile(), 1'700'000'000);
     FileMonitor monitor(loop, dbDir());
 
-    // First pass: read, client-id query, event.
-    monitor.runPass();
+    monitor.runPass();  // read, client-id query, event
     EXPECT_EQ(changes(), 1);
-    EXPECT_EQ(dataInstance().get().openid, "oid-1");
+    EXPECT_EQ(openid(), "oid-1");
     const auto query = sent();
     ASSERT_TRUE(query);
     EXPECT_EQ(nlohmann::json::parse(*query), (nlohmann::json{{"cmd", "QUERY_CLIENT_ID"}, {"openId", "oid-1"}}));
 
-    // Unchanged: nothing.
-    monitor.runPass();
+    monitor.runPass();  // unchanged: nothing
     EXPECT_EQ(changes(), 1);
     EXPECT_FALSE(sent());
+
+    // A new file renamed over the old one with the same size and modification time is read.
+    const std::string next = dbDir() + "/Config.db.new";
+    writeDatabase(next, "INSERT INTO User VALUES ('oid-2', '13812345678', 'tok-SECRET-2');"
+                        "INSERT INTO SoftwareSet VALUES ('oid-2', '/cfg/two', '/store/two');");
+    setModified(next, 1'700'000'000);
+    ASSERT_EQ(std::filesystem::file_size(next), std::filesystem::file_size(dbFile()));
+    std::filesystem::rename(next, dbFile());
+    monitor.runPass();
+    EXPECT_EQ(changes(), 2);
+    EXPECT_EQ(dataInstance().get().configDir, "/cfg/two");
+    EXPECT_TRUE(sent());
 
     // Touched: one more read and event.
     setModified(dbFile(), 1'700'000'100);
     monitor.runPass();
     monitor.runPass();
-    EXPECT_EQ(changes(), 2);
+    EXPECT_EQ(changes(), 3);
     EXPECT_TRUE(sent());
     EXPECT_FALSE(sent());
 
     // Removed: the account is cleared, nothing is published.
     std::filesystem::remove(dbFile());
     monitor.runPass();
-    EXPECT_EQ(changes(), 2);
+    EXPECT_EQ(changes(), 3);
     const databaseParam cleared = dataInstance().get();
     EXPECT_EQ(cleared.openid + cleared.Phone + cleared.token + cleared.configDir + cleared.storageDir, "");
-    EXPECT_EQ(cleared.lastOpenId, "oid-1");
+    EXPECT_EQ(cleared.lastOpenId, "oid-2");
 
     // Restored with its old modification time: read again all the same.
     writeDatabase(dbFile(), kSignedInRows);
     setModified(dbFile(), 1'700'000'100);
     monitor.runPass();
-    EXPECT_EQ(changes(), 3);
-    EXPECT_EQ(dataInstance().get().configDir, "/cfg/one");
-    EXPECT_TRUE(sent());
-    monitor.runPass();
-    EXPECT_EQ(changes(), 3);
-
-    // Not a database any more: published, the account stays.
-    env.dir().write("home/Library/Application Support/pcsuite/DataBase/Config.db", "garbage garbage garbage");
-    setModified(dbFile(), 1'700'000'200);
     monitor.runPass();
     EXPECT_EQ(changes(), 4);
-    EXPECT_EQ(dataInstance().get().openid, "oid-1");
+    EXPECT_EQ(dataInstance().get().configDir, "/cfg/one");
+    EXPECT_TRUE(sent());
+
+    // Not a database any more: published, the account stays.
+    writeSupportFile("DataBase/Config.db", "garbage garbage garbage");
+    setModified(dbFile(), 1'700'000'200);
+    monitor.runPass();
+    EXPECT_EQ(changes(), 5);
+    EXPECT_EQ(openid(), "oid-1");
     EXPECT_TRUE(sent());
 
     // Signed out: published, no client-id query.
     writeDatabase(dbFile(), "");
     setModified(dbFile(), 1'700'000'300);
     monitor.runPass();
-    EXPECT_EQ(changes(), 5);
-    EXPECT_EQ(dataInstance().get().openid, "");
+    EXPECT_EQ(changes(), 6);
+    EXPECT_EQ(openid(), "");
     EXPECT_FALSE(sent());
     EXPECT_EQ(todaysLog().find("tok-SECRET-1"), std::string::npos);
 }
 
-// Every way Config.db can go wrong, each entered from a good file and left back to it: the
-// account the service sees, and one log line per change of state, none on the passes after.
+// Each bad Config.db, entered from a good file and left back to it: one log line per change.
 TEST_F(FileMonitorTest, BadFilesKeepTheServiceGoingAndAreLoggedOncePerChange) {
     env.config().databaseBusyTimeout = 0ms;
     const std::string untyped = "CREATE TABLE User (openid, phone, token);"
                                 "CREATE TABLE SoftwareSet (openid, configDir, storageDir);";
+    std::string junk(8192, '\0');
+    std::uint32_t x = 2463534242u;
+    for (char& c : junk) c = static_cast<char>(x ^= x << 13, x ^= x >> 17, x ^= x << 5);
     struct Case {
         const char* name;
-        std::function<void()> make;
+        std::optional<std::string> script;  // SQL run on a new file; else raw `bytes`; neither: no file
+        std::optional<std::string> bytes;
         DatabaseState state;
         std::string openid;
     };
     const Case cases[] = {
-        {"missing", [&] { std::filesystem::remove(dbFile()); }, DatabaseState::Missing, ""},
-        {"empty", [&] { writeBytes(""); }, DatabaseState::Unreadable, "oid-1"},
-        {"random bytes",
-         [&] {
-             std::string junk(8192, '\0');
-             std::uint32_t x = 2463534242u;
-             for (char& c : junk) c = static_cast<char>(x ^= x << 13, x ^= x >> 17, x ^= x << 5);
-             writeBytes(junk);
-         },
-         DatabaseState::Unreadable, "oid-1"},
-        {"no User table",
-         [&] { writeDatabaseScript(dbFile(), "CREATE TABLE Other (x TEXT);"); },
-         DatabaseState::Unreadable, "oid-1"},
-        {"User without the columns",
-         [&] { writeDatabaseScript(dbFile(), "CREATE TABLE User (name TEXT);"); },
-         DatabaseState::Unreadable, "oid-1"},
-        {"integer open id",
-         [&] { writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (12345, 1, 2.5);"); },
-         DatabaseState::Good, "12345"},
-        {"blob open id that is not text",
-         [&] {
-             writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (X'FF00FE', X'00', 'tok');");
-         },
-         DatabaseState::Good, ""},
-        {"blob open id that is text",
-         [&] {
-             writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (X'6F69642D62', NULL, NULL);");
-         },
-         DatabaseState::Good, "oid-b"},
-        {"NULLs", [&] { writeDatabaseScript(dbFile(), untyped + "INSERT INTO User VALUES (NULL, NULL, NULL);"); },
-         DatabaseState::Good, ""},
+        {"missing", {}, {}, DatabaseState::Missing, ""},
+        {"empty", {}, "", DatabaseState::Unreadable, "oid-1"},
+        {"random bytes", {}, junk, DatabaseState::Unreadable, "oid-1"},
+        {"no User table", "CREATE TABLE Other (x TEXT);", {}, DatabaseState::Unreadable, "oid-1"},
+        {"User without the columns", "CREATE TABLE User (name TEXT);", {}, DatabaseState::Unreadable, "oid-1"},
+        {"integer open id", untyped + "INSERT INTO User VALUES (12345, 1, 2.5);", {}, DatabaseState::Good, "12345"},
+        {"blob not text", untyped + "INSERT INTO User VALUES (X'FF00FE', X'00', 'tok');", {}, DatabaseState::Good, ""},
+        {"blob text", untyped + "INSERT INTO User VALUES (X'6F69642D62', NULL, NULL);", {}, DatabaseState::Good, "oid-b"},
+        {"NULLs", untyped + "INSERT INTO User VALUES (NULL, NULL, NULL);", {}, DatabaseState::Good, ""},
     };
 
     std::time_t stamp = 1'700'000'000;
@@ -186,52 +189,42 @@ TEST_F(FileMonitorTest, BadFilesKeepTheServiceGoingAndAreLoggedOncePerChange) {
         SCOPED_TRACE(c.name);
         const bool bad = c.state != DatabaseState::Good;
         const int linesBefore = stateLines();
-        c.make();
+        if (c.script) writeDatabaseScript(dbFile(), *c.script);
+        else if (c.bytes) writeSupportFile("DataBase/Config.db", *c.bytes);
+        else std::filesystem::remove(dbFile());
         if (std::filesystem::exists(dbFile())) setModified(dbFile(), ++stamp);
         monitor.runPass();
         EXPECT_EQ(monitor.state(), c.state);
-        EXPECT_EQ(dataInstance().get().openid, c.openid);
         EXPECT_EQ(stateLines(), linesBefore + (bad ? 1 : 0));
         const std::size_t logSize = todaysLog().size();
         monitor.runPass();
         monitor.runPass();
         EXPECT_EQ(todaysLog().size(), logSize) << "a pass in an unchanged state logged";
-        EXPECT_EQ(dataInstance().get().openid, c.openid);
+        EXPECT_EQ(openid(), c.openid);
 
         good();
         monitor.runPass();
         EXPECT_EQ(monitor.state(), DatabaseState::Good);
-        EXPECT_EQ(dataInstance().get().openid, "oid-1");
         EXPECT_EQ(dataInstance().get().configDir, "/cfg/one");
         EXPECT_EQ(stateLines(), linesBefore + (bad ? 2 : 0));
     }
 }
 
-// The PC suite writes a new account and keeps the file locked (for seconds in real life; the
-// configured busy wait keeps it short here): each read gives up after the busy wait keeping
-// the old account, later passes try again without logging, and the account is read as soon
-// as the lock goes, without the file changing again.
+// A new account written under a held lock: the old account stays, retries log nothing, and
+// the new one is read once the lock goes although the file did not change again.
 TEST_F(FileMonitorTest, LockedDatabaseKeepsTheAccountUntilTheLockGoes) {
     env.config().databaseBusyTimeout = 20ms;
     writeDatabase(dbFile(), kSignedInRows);
     setModified(dbFile(), 1'700'000'000);
     FileMonitor monitor(loop, dbDir());
     monitor.runPass();
-    ASSERT_EQ(dataInstance().get().openid, "oid-1");
+    ASSERT_EQ(openid(), "oid-1");
     ASSERT_TRUE(sent());
 
-    sqlite3* writer = nullptr;
-    ASSERT_EQ(sqlite3_open(dbFile().c_str(), &writer), SQLITE_OK);
-    ASSERT_EQ(sqlite3_exec(writer,
-                           "UPDATE User SET openid = 'oid-2', token = 'tok-2';"
-                           "UPDATE SoftwareSet SET openid = 'oid-2' WHERE openid = 'oid-1';"
-                           "BEGIN EXCLUSIVE;",
-                           nullptr, nullptr, nullptr),
-              SQLITE_OK);
+    sqlite3* writer = lockedWriter(kSwitchAccount);
     const int lines = stateLines();
     monitor.runPass();
     EXPECT_EQ(monitor.state(), DatabaseState::Busy);
-    EXPECT_EQ(dataInstance().get().openid, "oid-1");
     EXPECT_EQ(dataInstance().get().token, "tok-SECRET-1");
     EXPECT_EQ(stateLines(), lines + 1);
     const int eventsWhileLocked = changes();
@@ -242,18 +235,15 @@ TEST_F(FileMonitorTest, LockedDatabaseKeepsTheAccountUntilTheLockGoes) {
     monitor.runPass();
     EXPECT_EQ(todaysLog().size(), logSize);
     EXPECT_EQ(changes(), eventsWhileLocked);
-    EXPECT_EQ(dataInstance().get().openid, "oid-1");
+    EXPECT_EQ(openid(), "oid-1");
 
     const auto lockedIdentity = FileMonitor::fileIdentity(dbFile());
-    ASSERT_EQ(sqlite3_exec(writer, "ROLLBACK;", nullptr, nullptr, nullptr), SQLITE_OK);
-    sqlite3_close(writer);
+    unlock(writer);
     ASSERT_EQ(FileMonitor::fileIdentity(dbFile()), lockedIdentity);  // only the retry can see it
     monitor.runPass();
     EXPECT_EQ(monitor.state(), DatabaseState::Good);
-    const databaseParam p = dataInstance().get();
-    EXPECT_EQ(p.openid, "oid-2");
-    EXPECT_EQ(p.token, "tok-2");
-    EXPECT_EQ(p.configDir, "/cfg/one");
+    EXPECT_EQ(dataInstance().get().token, "tok-2");
+    EXPECT_EQ(dataInstance().get().configDir, "/cfg/one");
     EXPECT_EQ(stateLines(), lines + 2);
     EXPECT_EQ(changes(), eventsWhileLocked + 1);
     const auto query = sent();
@@ -261,40 +251,16 @@ TEST_F(FileMonitorTest, LockedDatabaseKeepsTheAccountUntilTheLockGoes) {
     EXPECT_EQ(nlohmann::json::parse(*query)["openId"], "oid-2");
 }
 
-// A new file renamed over the old one with the same size and modification time is read.
-TEST_F(FileMonitorTest, FileReplacedByRenameIsRead) {
-    writeDatabase(dbFile(), kSignedInRows);
-    setModified(dbFile(), 1'700'000'000);
-    FileMonitor monitor(loop, dbDir());
-    monitor.runPass();
-    ASSERT_EQ(dataInstance().get().openid, "oid-1");
-
-    const std::string next = dbDir() + "/Config.db.new";
-    writeDatabase(next, "INSERT INTO User VALUES ('oid-2', '13812345678', 'tok-SECRET-2');"
-                        "INSERT INTO SoftwareSet VALUES ('oid-2', '/cfg/two', '/store/two');");
-    setModified(next, 1'700'000'000);
-    ASSERT_EQ(std::filesystem::file_size(next), std::filesystem::file_size(dbFile()));
-    std::filesystem::rename(next, dbFile());
-    monitor.runPass();
-    EXPECT_EQ(dataInstance().get().openid, "oid-2");
-    EXPECT_EQ(dataInstance().get().token, "tok-SECRET-2");
-    EXPECT_EQ(dataInstance().get().configDir, "/cfg/two");
-    EXPECT_EQ(changes(), 2);
-}
-
 TEST_F(FileMonitorTest, AttributesOfAVanishedFileAreNoChange) {
     auto last = FileMonitor::TimePoint(std::chrono::seconds(42));
     bool first = true;
     int times = 0;
     EXPECT_FALSE(FileMonitor::fileAttributeGet(dbDir(), last, first, times));
-    EXPECT_EQ(last, FileMonitor::TimePoint(std::chrono::seconds(42)));
     EXPECT_TRUE(first);
     EXPECT_EQ(times, 0);
-
-    // Same time as stored, first read: still read once.
     writeDatabase(dbFile(), "");
     setModified(dbFile(), 42);
-    EXPECT_TRUE(FileMonitor::fileAttributeGet(dbDir(), last, first, times));
+    EXPECT_TRUE(FileMonitor::fileAttributeGet(dbDir(), last, first, times));  // same time, first read
     EXPECT_FALSE(FileMonitor::fileAttributeGet(dbDir(), last, first, times));
     EXPECT_EQ(times, 1);
 
@@ -309,8 +275,8 @@ TEST_F(FileMonitorTest, AttributesOfAVanishedFileAreNoChange) {
     EXPECT_EQ(FileMonitor::getLocalDate("1970-01-01 00:00:00 +0000 trailing"), "");
 }
 
-// With a period far beyond the test's limits only the change notification can bring the
-// account in: the folder appearing after the start, then a new file renamed over the old one.
+// An hour's period: only the change notification can bring in the folder made after the start
+// and the file renamed into it.
 TEST_F(FileMonitorTest, ChangesAreSeenWithoutWaitingForThePeriod) {
     env.config().fileMonitorPeriod = std::chrono::hours(1);
     std::filesystem::remove_all(supportDir());
@@ -327,17 +293,15 @@ TEST_F(FileMonitorTest, ChangesAreSeenWithoutWaitingForThePeriod) {
     std::filesystem::create_directories(dbDir());
     replace(kSignedInRows);
     ASSERT_TRUE(events->waitFor("AccountChangeEvent", 1, 10s));
-    EXPECT_EQ(dataInstance().get().openid, "oid-1");
-
+    EXPECT_EQ(openid(), "oid-1");
     replace("INSERT INTO User VALUES ('oid-2', '13812345678', 'tok-SECRET-2');");
     ASSERT_TRUE(events->waitFor("AccountChangeEvent", 2, 10s));
-    EXPECT_EQ(dataInstance().get().openid, "oid-2");
+    EXPECT_EQ(openid(), "oid-2");
     monitor.stop();
     EXPECT_FALSE(monitor.running());
 }
 
-// While inotify watches, the periodic pass is rare; a read that found the file locked must
-// still be tried again every short period, since the lock going changes nothing in the file.
+// While watched the pass is rare, yet a locked read is retried on the short period.
 TEST_F(FileMonitorTest, LockedReadIsRetriedSoonWhileTheWatchMakesThePassRare) {
     env.config().databaseBusyTimeout = 20ms;
     env.config().fileMonitorPeriod = 20ms;
@@ -345,34 +309,23 @@ TEST_F(FileMonitorTest, LockedReadIsRetriedSoonWhileTheWatchMakesThePassRare) {
     writeDatabase(dbFile(), kSignedInRows);
     FileMonitor monitor(loop, dbDir());
     ASSERT_TRUE(monitor.start());
-    ASSERT_EQ(dataInstance().get().openid, "oid-1");
+    ASSERT_EQ(openid(), "oid-1");
     const int started = changes();
 
-    sqlite3* writer = nullptr;
-    ASSERT_EQ(sqlite3_open(dbFile().c_str(), &writer), SQLITE_OK);
-    ASSERT_EQ(sqlite3_exec(writer,
-                           "BEGIN EXCLUSIVE;"
-                           "UPDATE User SET openid = 'oid-2', token = 'tok-2';"
-                           "UPDATE SoftwareSet SET openid = 'oid-2' WHERE openid = 'oid-1';"
-                           "COMMIT; BEGIN EXCLUSIVE;",
-                           nullptr, nullptr, nullptr),
-              SQLITE_OK);
-    // The change is noticed but cannot be read yet.
-    ASSERT_TRUE(events->waitFor("AccountChangeEvent", started + 1, 10s));
-    EXPECT_EQ(dataInstance().get().openid, "oid-1");
-    ASSERT_EQ(sqlite3_exec(writer, "ROLLBACK;", nullptr, nullptr, nullptr), SQLITE_OK);
-    sqlite3_close(writer);
+    sqlite3* writer = lockedWriter(std::string("BEGIN EXCLUSIVE;") + kSwitchAccount + "COMMIT;");
+    ASSERT_TRUE(events->waitFor("AccountChangeEvent", started + 1, 10s));  // noticed, not readable yet
+    EXPECT_EQ(openid(), "oid-1");
+    unlock(writer);
     ASSERT_TRUE(events->waitFor("AccountChangeEvent", started + 2, 10s));
-    EXPECT_EQ(dataInstance().get().openid, "oid-2");
+    EXPECT_EQ(openid(), "oid-2");
     monitor.stop();
 }
 
 TEST_F(FileMonitorTest, ServiceStartReadsWithoutWaitingAPeriodAndFillsTheDeviceId) {
-    // A period far beyond the test's limits: the first read must not wait for it, and
-    // stopping must not either.
+    // An hour's period: neither the first read nor the stop may wait for it.
     env.config().fileMonitorPeriod = std::chrono::hours(1);
     env.config().pcsuitePort = freeTcpPort();  // nobody answers there
-    env.dir().write("home/Library/Application Support/pcsuite/config.json", R"({"newDeviceId": "file-id"})");
+    writeSupportFile("config.json", R"({"newDeviceId": "file-id"})");
     writeDatabase(dbFile(), kSignedInRows);
 
     ASSERT_TRUE(fileMonitorStart(loop));
@@ -380,7 +333,7 @@ TEST_F(FileMonitorTest, ServiceStartReadsWithoutWaitingAPeriodAndFillsTheDeviceI
     EXPECT_EQ(dataInstance().get().version, Log::versionCode);
     EXPECT_FALSE(fileMonitorStart(loop));
     ASSERT_TRUE(events->waitFor("AccountChangeEvent", 1));
-    EXPECT_EQ(dataInstance().get().openid, "oid-1");
+    EXPECT_EQ(openid(), "oid-1");
     fileMonitorStop();
 }
 

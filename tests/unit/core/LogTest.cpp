@@ -3,6 +3,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <sstream>
 #include <thread>
 
 #include "core/Json.h"
@@ -37,14 +38,14 @@ public:
 };
 
 WallClock::Clock::time_point utc(int y, int mo, int d, int h, int mi, int s, int ms) {
-    std::tm tm{};
-    tm.tm_year = y - 1900;
-    tm.tm_mon = mo - 1;
-    tm.tm_mday = d;
-    tm.tm_hour = h;
-    tm.tm_min = mi;
-    tm.tm_sec = s;
+    std::tm tm{.tm_sec = s, .tm_min = mi, .tm_hour = h, .tm_mday = d, .tm_mon = mo - 1, .tm_year = y - 1900};
     return WallClock::Clock::from_time_t(timegm(&tm)) + std::chrono::milliseconds(ms);
+}
+
+// Logs `line` with the clock fixed at `t`.
+void logAt(WallClock::Clock::time_point t, const std::string& line) {
+    ScopedClock clock(t);
+    Log::mPrintlog(line);
 }
 
 class LogFiles : public ::testing::Test {
@@ -58,19 +59,9 @@ protected:
 
 TEST_F(LogFiles, LinesGoToTheFileOfTheGmtDate) {
     ScopedZone zone("Asia/Shanghai");  // eight hours ahead of GMT
-    {
-        ScopedClock clock(utc(2026, 12, 3, 23, 59, 59, 900));
-        Log::mPrintlog("[LogTest] before midnight");
-    }
-    {
-        // 00:30 local on the 4th is still the 3rd in GMT.
-        ScopedClock clock(utc(2026, 12, 3, 16, 30, 0, 0));
-        Log::mPrintlog("[LogTest] local morning");
-    }
-    {
-        ScopedClock clock(utc(2026, 12, 4, 0, 0, 0, 100));
-        Log::mPrintlog("[LogTest] after midnight");
-    }
+    logAt(utc(2026, 12, 3, 23, 59, 59, 900), "[LogTest] before midnight");
+    logAt(utc(2026, 12, 3, 16, 30, 0, 0), "[LogTest] local morning");  // 00:30 local on the 4th
+    logAt(utc(2026, 12, 4, 0, 0, 0, 100), "[LogTest] after midnight");
     Log::closeLog();
     const std::string day3 = test::readAll(file("2026-12-03"));
     const std::string day4 = test::readAll(file("2026-12-04"));
@@ -94,18 +85,13 @@ TEST_F(LogFiles, ConcurrentLinesNeverInterleave) {
     for (auto& th : threads) th.join();
     Log::closeLog();
     const std::string log = test::readAll(Log::logFilePath(WallClock::now()));
+    ASSERT_EQ(log.back(), '\n');
+    std::istringstream lines(log);
     int count = 0;
-    std::size_t start = 0;
-    while (start < log.size()) {
-        std::size_t end = log.find('\n', start);
-        ASSERT_NE(end, std::string::npos);
-        const std::string line = log.substr(start, end - start);
+    for (std::string line; std::getline(lines, line); ++count) {
         const auto pos = line.find("[logLoop] [LogTest] thread ");
         ASSERT_NE(pos, std::string::npos) << line;
-        const char t = line[pos + 27];
-        EXPECT_EQ(line.substr(line.size() - 100), std::string(100, static_cast<char>('a' + (t - '0')))) << line;
-        ++count;
-        start = end + 1;
+        EXPECT_EQ(line.substr(line.size() - 100), std::string(100, static_cast<char>('a' + line[pos + 27] - '0')));
     }
     EXPECT_EQ(count, kThreads * kLines);
 }
@@ -154,10 +140,7 @@ TEST_F(LogFiles, DailyFileStopsAtItsSizeLimitUntilTheNextDay) {
     for (std::size_t i = 0; i < written; ++i)
         EXPECT_NE(day3.find("[LogTest] line " + std::to_string(i) + " "), std::string::npos) << i;
 
-    {
-        ScopedClock clock(utc(2026, 12, 4, 0, 0, 0, 0));
-        Log::mPrintlog("[LogTest] next day");
-    }
+    logAt(utc(2026, 12, 4, 0, 0, 0, 0), "[LogTest] next day");
     const std::string day4 = test::readAll(file("2026-12-04"));
     EXPECT_NE(day4.find("[logLoop] [LogTest] next day\n"), std::string::npos) << day4;
     EXPECT_EQ(day4.find("[log] daily log file"), std::string::npos);
@@ -167,7 +150,7 @@ TEST_F(LogFiles, DailyFileStopsAtItsSizeLimitUntilTheNextDay) {
 TEST_F(LogFiles, RestartOnTheSameDayKeepsTheCap) {
     env.config().logFileMaxBytes = 1000;
     ScopedClock clock(utc(2026, 12, 3, 10, 0, 0, 0));
-    // The notice may leave the file below the limit: a later run still adds nothing.
+    // The notice may leave the file below the limit: a later line still adds nothing.
     Log::mPrintlog("[LogTest] long " + std::string(650, 'x'));
     Log::mPrintlog("[LogTest] too long " + std::string(400, 'y'));
     Log::closeLog();

@@ -1,7 +1,5 @@
 // Single-instance rule, the seven-day restart rule and the control-server watchdog.
 #include <gtest/gtest.h>
-#include <httplib.h>
-#include <sys/wait.h>
 
 #include <filesystem>
 #include <fstream>
@@ -17,7 +15,6 @@
 #include "core/Log.h"
 #include "core/WallClock.h"
 #include "pcsuite/PcsuiteClient.h"
-#include "support/TestSupport.h"
 #include "support/ServiceProcess.h"
 #include "support/TestSupport.h"
 
@@ -57,6 +54,10 @@ protected:
         const auto t = *timeutil::parseLocal(localTime);
         WallClock::setClock([t] { return t; });
     }
+    static std::string logSoFar() {
+        Log::closeLog();
+        return test::readAll(Log::logFilePath(WallClock::now()));
+    }
     test::HermeticEnv env;
 };
 
@@ -64,32 +65,26 @@ TEST_F(RestartRule, RestartsAfterMoreThanSevenWholeDaysOfAUsableVersionFile) {
     EventLoop loop;
     RestartServiceSubscriber subscriber(loop);
     versionUpdated("2026-11-26 10:00:00.000");
-    now("2026-12-03 10:00:00.000");  // exactly 7 days
-    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
-    now("2026-12-04 09:59:59.999");  // 7 days and almost 24 hours
-    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
-    now("2026-12-04 10:00:00.000");  // 8 days
-    EXPECT_TRUE(subscriber.connServiceRunOutOfDate());
-    // A version file from the future is not out of date.
-    now("2026-11-01 10:00:00.000");
-    EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
+    // Exactly 7 days, 7 days and almost 24 hours, 8 days, a version file from the future.
+    for (const auto& [time, outOfDate] : {std::pair{"2026-12-03 10:00:00.000", false}, {"2026-12-04 09:59:59.999", false},
+                                          {"2026-12-04 10:00:00.000", true}, {"2026-11-01 10:00:00.000", false}}) {
+        now(time);
+        EXPECT_EQ(subscriber.connServiceRunOutOfDate(), outOfDate) << time;
+    }
 
     // A missing or unusable version file counts as current.
     now("2026-12-04 10:00:00.000");
     std::filesystem::remove(rootedPath(Config::current().versionFile));
     EXPECT_FALSE(subscriber.connServiceRunOutOfDate());
-    for (const std::string& content :
-         {std::string(""), std::string("not json"), std::string(R"({"version":"3.6.1.0"})"),
-          std::string(R"({"updateTime":"2020-01-01"})"), std::string(R"({"updateTime":12345})"),
-          std::string(R"(["2020-01-01 00:00:00.000"])")}) {
+    for (const char* content : {"", "not json", R"({"version":"3.6.1.0"})", R"({"updateTime":"2020-01-01"})",
+                                R"({"updateTime":12345})", R"(["2020-01-01 00:00:00.000"])"}) {
         writeVersion(content);
         EXPECT_FALSE(subscriber.connServiceRunOutOfDate()) << content;
     }
 }
 
 TEST_F(RestartRule, OnlyLogOnWithoutConnectionTriggersTheCheck) {
-    // An out-of-date version file whose restart target cannot run: the service logs the
-    // attempt and keeps running.
+    // Out of date, but the restart target cannot run: a restart attempt would only be logged.
     versionUpdated("2026-11-01 10:00:00.000");
     now("2026-12-04 10:00:00.000");
     Config::current().serviceExecutable = "/nonexistent/KesuConnService";
@@ -100,29 +95,21 @@ TEST_F(RestartRule, OnlyLogOnWithoutConnectionTriggersTheCheck) {
     for (ServiceEvent other : {ServiceEvent::LogOut, ServiceEvent::WifiOpen, ServiceEvent::Pcsuite})
         subscriber->notify(other);
     ASSERT_TRUE(subscriber->waitIdle(5s));
-    Log::closeLog();
-    std::string log = test::readAll(Log::logFilePath(WallClock::now()));
-    EXPECT_EQ(log.find("Now connservice run"), std::string::npos) << log;
+    EXPECT_EQ(logSoFar().find("Now connservice run"), std::string::npos) << logSoFar();
 
     ConnectionState::setIsCanConnectDevice(false);  // a connection in progress: no check
     subscriber->notify(ServiceEvent::LogOn);
     ASSERT_TRUE(subscriber->waitIdle(5s));
-    Log::closeLog();
-    log = test::readAll(Log::logFilePath(WallClock::now()));
-    EXPECT_EQ(log.find("restart KesuConnService"), std::string::npos) << log;
+    EXPECT_EQ(logSoFar().find("restart KesuConnService"), std::string::npos) << logSoFar();
 }
 
-// The restart replaces the process image in place: the restarted program runs with the
-// same process id, so it never sees its predecessor in the process list.
+// The restart replaces the process image in place (same pid, so no predecessor is listed).
 TEST(SelfRestart, ReplacesTheProcessImageInPlace) {
     test::TempDir dir;
-    const std::string root = dir.str() + "/root";
-    const std::string exe =
-        root + "/Applications/pcsuite.app/Contents/Resources/kesuesService/KesuConnService/KesuConnService";
-    const std::string marker = dir.str() + "/restarted";
-    dir.write("root/Applications/pcsuite.app/Contents/Resources/kesuesService/KesuConnService/KesuConnService",
-              "#!/bin/sh\necho $$ > '" + marker + "'\n");
-    std::filesystem::permissions(exe, std::filesystem::perms::owner_all);
+    const std::string root = dir.str() + "/root", marker = dir.str() + "/restarted";
+    const std::string exe = "/Applications/pcsuite.app/Contents/Resources/kesuesService/KesuConnService/KesuConnService";
+    dir.write("root" + exe, "#!/bin/sh\necho $$ > '" + marker + "'\n");
+    std::filesystem::permissions(root + exe, std::filesystem::perms::owner_all);
 
     test::ServiceProcess probe(KESU_RESTART_PROBE, {}, {{"HOME", dir.str()}, {"KESU_ROOT", root}});
     EXPECT_EQ(probe.waitExit(20s), 0) << probe.output();
@@ -147,9 +134,8 @@ TEST(Watchdog, RestartsAServerThatStoppedAnswering) {
     ASSERT_TRUE(watchdog.waitForRestarts(1, 10s));
     EXPECT_TRUE(PcsuiteClient::isHttpAlive());
     watchdog.stop();
-    // A healthy server is left alone.
     HttpAliveCheck quiet(loop, server);
-    EXPECT_FALSE(quiet.waitForRestarts(1, 500ms));
+    EXPECT_FALSE(quiet.waitForRestarts(1, 500ms));  // a healthy server is left alone
     quiet.stop();
     server.stop();
     Log::closeLog();

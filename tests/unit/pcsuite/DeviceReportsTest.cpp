@@ -1,6 +1,4 @@
-// Device-list reports: the change rule, the delay/throttle/coalescing of sends, the network
-// and application tests, the expiry sweep, and the start-up wiring, all against a stub PC
-// suite on loopback that records what was posted.
+// Device-list reports against a stub PC suite on loopback that records what was posted.
 #include <gtest/gtest.h>
 
 #include <chrono>
@@ -31,25 +29,6 @@ std::string element(const std::string& hexId, const std::string& ip, const std::
     return R"({"account":")" + account + R"(","deviceId":")" + hexId +
            R"(","deviceName":"X1 Pro","deviceType":"phone","guide":"G1","ip":[")" + ip +
            R"("],"isAccountFull":false,"isDeviceNameFull":true,"isOpenIdSame":true,"openId":"openid-of-this-pc"})";
-}
-
-// Waits until `count` requests for `path` have arrived (other paths may arrive meanwhile).
-bool waitForPath(const test::StubPcSuite& stub, const std::string& path, std::size_t count,
-                 std::chrono::milliseconds timeout) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    for (;;) {
-        if (stub.requestsTo(path).size() >= count) return true;
-        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
-        if (left <= 0ms || !stub.waitForRequests(stub.requestCount() + 1, left))
-            return stub.requestsTo(path).size() >= count;
-    }
-}
-
-// Every recorded request as "METHOD path", for failure messages.
-std::string seen(const test::StubPcSuite& stub) {
-    std::string out;
-    for (const auto& r : stub.requests()) out += r.method + " " + r.path + "; ";
-    return out;
 }
 
 // A pre-connect entry as the registry holds it; only its PC suite form matters here.
@@ -83,31 +62,47 @@ protected:
         loop.start();
     }
 
+    // A started LAN reporter woken by the table's change rule.
     std::shared_ptr<WlanReportDevices> lanReporter() {
         auto reporter = std::make_shared<WlanReportDevices>(table);
         reporter->start(loop);
+        compare.addObserver(reporter);
         return reporter;
     }
 
-    // Waits for the n-th request to `path` (LAN list unless told).
+    // Waits for the n-th request to `path` (LAN list unless told); other paths may come meanwhile.
     bool reports(std::size_t n, std::chrono::milliseconds timeout, const std::string& path = kLanPath) {
-        return waitForPath(pcsuite, path, n, timeout);
+        const auto deadline = std::chrono::steady_clock::now() + timeout;
+        for (;;) {
+            if (pcsuite.requestsTo(path).size() >= n) return true;
+            const auto left =
+                std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+            if (left <= 0ms || !pcsuite.waitForRequests(pcsuite.requestCount() + 1, left))
+                return pcsuite.requestsTo(path).size() >= n;
+        }
     }
+    // Every recorded request as "METHOD path", for failure messages.
+    std::string seen() const {
+        std::string out;
+        for (const auto& r : pcsuite.requests()) out += r.method + " " + r.path + "; ";
+        return out;
+    }
+    std::string body(std::size_t i) const { return pcsuite.requestsTo(kLanPath).at(i).body; }
 
-    void hear(const Json& announcement, const std::string& ip) {
-        SsdpMessage::insertResponseDevice(json::compact(announcement), ip, "openid-of-this-pc", true, table);
+    void hear(const Json& announcement, const std::string& ip, SsdpDeviceManager& into) {
+        SsdpMessage::insertResponseDevice(json::compact(announcement), ip, "openid-of-this-pc", true, into);
     }
+    void hear(const Json& announcement, const std::string& ip) { hear(announcement, ip, table); }
 
     test::StubPcSuite pcsuite;
     SsdpDeviceManager table{64, 30.0, clock};
+    WlanDetectedDeviceCompare compare{table};
     EventLoop loop;
 };
 
 TEST_F(DeviceReportsTest, OnlyNewDevicesAndAccountGuideOpenIdChangesCount) {
     env.config().reportDelay = 1h;  // nothing is sent: a waiting report shows a notification
-    WlanDetectedDeviceCompare compare(table);
     auto reporter = lanReporter();
-    compare.addObserver(reporter);
     auto notified = [&] {
         const bool waiting = !reporter->waitIdle(0ms);
         reporter->cancel();
@@ -142,43 +137,35 @@ TEST_F(DeviceReportsTest, OnlyNewDevicesAndAccountGuideOpenIdChangesCount) {
 TEST_F(DeviceReportsTest, BurstGoesAsOneListAndTheThrottleHoldsTheNext) {
     env.config().reportDelay = 300ms;
     env.config().reportThrottle = 1h;
-    WlanDetectedDeviceCompare compare(table);
     auto reporter = lanReporter();
-    compare.addObserver(reporter);
 
     hear(phoneBody("bbbb"), "10.0.0.2");
     hear(phoneBody("aaaa"), "10.0.0.1");
-    ASSERT_TRUE(reports(1, 10s)) << seen(pcsuite);
-    const auto first = pcsuite.requestsTo(kLanPath).at(0);
-    EXPECT_EQ(first.method, "POST");
-    EXPECT_EQ(first.body, "[" + element("61616161", "10.0.0.1") + ", " + element("62626262", "10.0.0.2") + "]");
+    ASSERT_TRUE(reports(1, 10s)) << seen();
+    EXPECT_EQ(pcsuite.requestsTo(kLanPath).at(0).method, "POST");
+    EXPECT_EQ(body(0), "[" + element("61616161", "10.0.0.1") + ", " + element("62626262", "10.0.0.2") + "]");
 
     // The next change waits for the throttle; stop() ends that wait and nothing goes.
     hear(phoneBody("cccc"), "10.0.0.3");
-    EXPECT_FALSE(reports(2, 500ms)) << seen(pcsuite);
+    EXPECT_FALSE(reports(2, 500ms)) << seen();
     reporter->stop();
     compare.notifySubscribers();  // a stopped reporter ignores notifications
-    EXPECT_FALSE(reports(2, 200ms)) << seen(pcsuite);
-    EXPECT_EQ(pcsuite.requestsTo(kLanPath).size(), 1u);
+    EXPECT_FALSE(reports(2, 200ms)) << seen();
 }
 
 TEST_F(DeviceReportsTest, ChangeWhileAListIsPostedGetsAFollowUp) {
     env.config().reportThrottle = 200ms;
     pcsuite.queueAnswer(kLanPath, {200, R"({"code":"000000"})", "application/json", 700ms});
-    WlanDetectedDeviceCompare compare(table);
     auto reporter = lanReporter();
-    compare.addObserver(reporter);
 
     hear(phoneBody("aaaa"), "10.0.0.1");
-    ASSERT_TRUE(reports(1, 10s)) << seen(pcsuite);  // its answer is still held back
+    ASSERT_TRUE(reports(1, 10s)) << seen();  // its answer is still held back
     hear(phoneBody("bbbb"), "10.0.0.2");
     hear(phoneBody("bbbb", "139****1111"), "10.0.0.2");
-    ASSERT_TRUE(reports(2, 10s)) << seen(pcsuite);
-    EXPECT_FALSE(reports(3, 600ms)) << seen(pcsuite);  // one follow-up, not one per change
-    const auto requests = pcsuite.requestsTo(kLanPath);
-    ASSERT_EQ(requests.size(), 2u);
-    EXPECT_EQ(requests[0].body, "[" + element("61616161", "10.0.0.1") + "]");
-    EXPECT_EQ(requests[1].body, "[" + element("61616161", "10.0.0.1") + ", " +
+    ASSERT_TRUE(reports(2, 10s)) << seen();
+    EXPECT_FALSE(reports(3, 600ms)) << seen();  // one follow-up, not one per change
+    EXPECT_EQ(body(0), "[" + element("61616161", "10.0.0.1") + "]");
+    EXPECT_EQ(body(1), "[" + element("61616161", "10.0.0.1") + ", " +
                                     element("62626262", "10.0.0.2", "139****111") + "]");
 }
 
@@ -187,11 +174,13 @@ TEST_F(DeviceReportsTest, NetworkAndApplicationTests) {
     WlanReportDevices lan(table);
     hear(phoneBody("aaaa"), "10.0.0.1");
     const std::string url = pcsuite.baseUrl() + "SSDPQueryAll";
+    const std::string preconnectUrl = pcsuite.baseUrl() + "RH2RF_PUSH_GATT_CLIENT_LIST";
+    auto sent = [&](const char* path) { return pcsuite.requestsTo(path).size(); };
 
     // No Ethernet adapter and Wi-Fi off: nothing posted.
     fake->setNetworkServices({{"Wi-Fi", "wlan0", "aa:bb:cc:dd:ee:02"}});
     EXPECT_FALSE(lan.send(url));
-    EXPECT_TRUE(pcsuite.requestsTo(kLanPath).empty());
+    EXPECT_EQ(sent(kLanPath), 0u);
 
     // Wi-Fi switched on is enough; so is an Ethernet adapter, even without an address.
     fake->setWifiPowerOn(true);
@@ -199,7 +188,6 @@ TEST_F(DeviceReportsTest, NetworkAndApplicationTests) {
     fake->setWifiPowerOn(false);
     fake->setNetworkServices({{"Ethernet", "eth1", "aa:bb:cc:dd:ee:03"}});
     EXPECT_TRUE(lan.send(url));
-    EXPECT_EQ(pcsuite.requestsTo(kLanPath).size(), 2u);
 
     // The application test: exactly two of the PC suite's processes read as "not running".
     const std::string app = DeviceListReporter::pcsuiteAppName;
@@ -207,19 +195,17 @@ TEST_F(DeviceReportsTest, NetworkAndApplicationTests) {
     ReportDevicesV2 preconnect(registry);
     fake->setRunningApplicationNames({app, "bash", app});
     EXPECT_FALSE(lan.send(url));
-    EXPECT_FALSE(preconnect.send(pcsuite.baseUrl() + "RH2RF_PUSH_GATT_CLIENT_LIST"));
-    EXPECT_EQ(pcsuite.requestsTo(kLanPath).size(), 2u);
-    EXPECT_TRUE(pcsuite.requestsTo(kPreconnectPath).empty());
+    EXPECT_FALSE(preconnect.send(preconnectUrl));
+    EXPECT_EQ(sent(kLanPath) + sent(kPreconnectPath), 2u);
     fake->setRunningApplicationNames({app});
     EXPECT_TRUE(lan.send(url));
-    EXPECT_EQ(pcsuite.requestsTo(kLanPath).size(), 3u);
 
     // The pre-connect list has no network test.
     fake->setNetworkServices({});
-    EXPECT_TRUE(preconnect.send(pcsuite.baseUrl() + "RH2RF_PUSH_GATT_CLIENT_LIST"));
+    EXPECT_TRUE(preconnect.send(preconnectUrl));
     EXPECT_FALSE(lan.send(url));
-    EXPECT_EQ(pcsuite.requestsTo(kLanPath).size(), 3u);
-    EXPECT_EQ(pcsuite.requestsTo(kPreconnectPath).size(), 1u);
+    EXPECT_EQ(sent(kLanPath), 3u);
+    EXPECT_EQ(sent(kPreconnectPath), 1u);
 
     // No PC suite listening: the post fails.
     pcsuite.stop();
@@ -238,7 +224,7 @@ TEST_F(DeviceReportsTest, PreconnectListPostsEveryEntry) {
 
     reporter.notify();
     reporter.notify();
-    ASSERT_TRUE(reports(1, 10s, kPreconnectPath)) << seen(pcsuite);
+    ASSERT_TRUE(reports(1, 10s, kPreconnectPath)) << seen();
     ASSERT_TRUE(reporter.waitIdle(10s));
     EXPECT_EQ(pcsuite.requestsTo(kPreconnectPath).size(), 1u);  // two notifications, one list
     EXPECT_EQ(pcsuite.requestsTo(kPreconnectPath).at(0).body,
@@ -247,42 +233,35 @@ TEST_F(DeviceReportsTest, PreconnectListPostsEveryEntry) {
 }
 
 TEST_F(DeviceReportsTest, ReannouncedDeviceIsReportedOnceThenOnceMoreWhenItExpires) {
-    WlanDetectedDeviceCompare compare(table);
     WlanDeviceDelete expiry(loop, table);
     auto reporter = lanReporter();
-    compare.addObserver(reporter);
     expiry.addObserver(reporter);
     expiry.detectedToDelete(env.config().expirySweepPeriod);
 
     hear(phoneBody("aaaa"), "10.0.0.1");
-    ASSERT_TRUE(reports(1, 10s)) << seen(pcsuite);
+    ASSERT_TRUE(reports(1, 10s)) << seen();
     for (int i = 0; i < 5; ++i) {  // the sweep runs meanwhile: every 5 s keeps it listed
         advance(5);
         hear(phoneBody("aaaa"), "10.0.0.1");
     }
-    EXPECT_FALSE(reports(2, 400ms)) << seen(pcsuite);
+    EXPECT_FALSE(reports(2, 400ms)) << seen();
 
-    // Silent for more than 30 s: the sweep removes it and the empty list goes.
-    advance(30.5);
-    ASSERT_TRUE(reports(2, 10s)) << seen(pcsuite);
-    const auto requests = pcsuite.requestsTo(kLanPath);
-    ASSERT_EQ(requests.size(), 2u);
-    EXPECT_EQ(requests[0].body, "[" + element("61616161", "10.0.0.1") + "]");
-    EXPECT_EQ(requests[1].body, "[]");
+    advance(30.5);  // silent for more than 30 s: removed, the empty list goes
+    ASSERT_TRUE(reports(2, 10s)) << seen();
+    EXPECT_EQ(body(1), "[]");
     EXPECT_EQ(table.ssdpDeviceMap.size(), 0u);
 
     // Sweeps that remove nothing send nothing; a stopped sweep removes no more.
-    EXPECT_FALSE(reports(3, 300ms)) << seen(pcsuite);
+    EXPECT_FALSE(reports(3, 300ms)) << seen();
     expiry.stop();
     hear(phoneBody("bbbb"), "10.0.0.2");
-    ASSERT_TRUE(reports(3, 10s)) << seen(pcsuite);
+    ASSERT_TRUE(reports(3, 10s)) << seen();
     advance(60);
-    EXPECT_FALSE(reports(4, 300ms)) << seen(pcsuite);
+    EXPECT_FALSE(reports(4, 300ms)) << seen();
     EXPECT_EQ(table.ssdpDeviceMap.size(), 1u);
 }
 
-// The sweep sleeps while the table is empty and wakes at the next expiry, not on its period:
-// each device heard into an empty table is still removed, and the removal reported.
+// An empty table's sweep wakes at the next expiry, not on its (hour-long) period.
 TEST_F(DeviceReportsTest, SweepWakesForTheNextExpiryOfAFreshlyFilledTable) {
     SsdpDeviceManager live{64, 0.2};  // the real clock
     WlanDeviceDelete expiry(loop, live);
@@ -292,15 +271,14 @@ TEST_F(DeviceReportsTest, SweepWakesForTheNextExpiryOfAFreshlyFilledTable) {
     expiry.detectedToDelete(1h);
     for (const std::string id : {"aaaa", "bbbb"}) {
         const std::size_t before = pcsuite.requestsTo(kLanPath).size();
-        SsdpMessage::insertResponseDevice(json::compact(phoneBody(id)), "10.0.0.1", "openid-of-this-pc", true, live);
-        ASSERT_TRUE(reports(before + 1, 10s)) << seen(pcsuite);
+        hear(phoneBody(id), "10.0.0.1", live);
+        ASSERT_TRUE(reports(before + 1, 10s)) << seen();
         EXPECT_EQ(pcsuite.requestsTo(kLanPath).back().body, "[]");
         EXPECT_EQ(live.ssdpDeviceMap.size(), 0u);
     }
 }
 
-// The service manager's wiring: a first LAN list at start, one per new device heard through
-// the process-wide table, one on the control request startSSDPScan, none after stop().
+// Service wiring: a LAN list at start, per new device, on startSSDPScan, none after stop().
 TEST_F(DeviceReportsTest, ServiceStartWiresTheLanReports) {
     env.config().phoneTcpPort = test::freeTcpPort();
     env.config().ssdpPort = test::freeTcpPort();
@@ -311,21 +289,21 @@ TEST_F(DeviceReportsTest, ServiceStartWiresTheLanReports) {
     loop.start();
     ServiceManager manager(loop);
     manager.start();
-    ASSERT_TRUE(waitForPath(pcsuite, kLanPath, 1, 10s));
-    EXPECT_EQ(pcsuite.requestsTo(kLanPath).at(0).body, "[]");
+    ASSERT_TRUE(reports(1, 10s));
+    EXPECT_EQ(body(0), "[]");
 
-    SsdpMessage::insertResponseDevice(json::compact(phoneBody("aaaa")), "10.0.0.1", "openid-of-this-pc", true);
-    ASSERT_TRUE(waitForPath(pcsuite, kLanPath, 2, 10s));
-    EXPECT_EQ(pcsuite.requestsTo(kLanPath).at(1).body, "[" + element("61616161", "10.0.0.1") + "]");
+    hear(phoneBody("aaaa"), "10.0.0.1", global);
+    ASSERT_TRUE(reports(2, 10s));
+    EXPECT_EQ(body(1), "[" + element("61616161", "10.0.0.1") + "]");
 
     EXPECT_EQ(test::control("startSSDPScan")["error"], 0);
-    ASSERT_TRUE(waitForPath(pcsuite, kLanPath, 3, 10s));
-    EXPECT_EQ(pcsuite.requestsTo(kLanPath).at(2).body, "[" + element("61616161", "10.0.0.1") + "]");
+    ASSERT_TRUE(reports(3, 10s));
+    EXPECT_EQ(body(2), body(1));
 
     manager.stop();
     WlanDetectedDeviceCompare::instance().notifySubscribers();
-    SsdpMessage::insertResponseDevice(json::compact(phoneBody("bbbb")), "10.0.0.2", "openid-of-this-pc", true);
-    EXPECT_FALSE(waitForPath(pcsuite, kLanPath, 4, 300ms));
+    hear(phoneBody("bbbb"), "10.0.0.2", global);
+    EXPECT_FALSE(reports(4, 300ms));
     global.ssdpDeviceMap.clear();
 }
 
