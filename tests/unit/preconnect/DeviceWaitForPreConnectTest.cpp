@@ -35,7 +35,6 @@ TEST(FarawayDeviceTest, CloudRecordBecomesTheRecordAndItsLocalForm) {
     const Json local = device.getLocalInfo();
     EXPECT_EQ(device.getDeviceId(), "61626364");  // only the first four characters count
     EXPECT_EQ(local["type"], "unknowed");
-    EXPECT_EQ(local["btSwitch"], 1);
     EXPECT_EQ(local["wifiSwitch"], 0);  // a missing key reads as 0
     EXPECT_EQ(local["ext"], Json({{"k", {1, 2}}}));
     ASSERT_EQ(local["inets"].size(), 3u);
@@ -71,6 +70,24 @@ TEST(FarawayDeviceTest, ClientGenerations) {
     device.destroyClient();
 }
 
+// The kernel's keep-alive timer ("tr" 2 in /proc/net/tcp) of the PC's end of links to `port`,
+// in seconds; nullopt when there is no such link or its timer is another.
+std::optional<long> keepAliveSeconds(int port) {
+    std::ifstream table("/proc/net/tcp");
+    std::string line;
+    char remote[16];
+    std::snprintf(remote, sizeof remote, ":%04X ", port);
+    while (std::getline(table, line)) {
+        std::istringstream fields(line);
+        std::string slot, local, peer, state, queues, timer;
+        fields >> slot >> local >> peer >> state >> queues >> timer;
+        if ((peer + " ").find(remote) == std::string::npos || state != "01") continue;
+        if (timer.rfind("02:", 0) != 0) return std::nullopt;
+        return std::stol(timer.substr(3), nullptr, 16) / 100;  // jiffies as USER_HZ
+    }
+    return std::nullopt;
+}
+
 TEST_F(PreconnectTest, AcceptedHandshakeHoldsTheLinkAndAnswersThePhone) {
     pcsuite.setAnswer("/connectDevice", {200, R"({"code":"000000","data":{"code":7,"reason":"shown"}})"});
     phonesim::Listener phone(phoneOptions());
@@ -82,6 +99,10 @@ TEST_F(PreconnectTest, AcceptedHandshakeHoldsTheLinkAndAnswersThePhone) {
     EXPECT_EQ(entry->getPreConnectStep(), stepEntry(sharedStep().OS4_WLAN_PING_ADDRESS, Result::FAILED));
     EXPECT_EQ(entry->getWlanDeviceIp(), "127.0.0.1");
     EXPECT_TRUE(entry->getIsOpenIdSame());
+    const auto keepAlive = keepAliveSeconds(phone.port());  // the held link has keep-alive
+    ASSERT_TRUE(keepAlive);
+    EXPECT_GT(*keepAlive, 20);
+    EXPECT_LE(*keepAlive, 30);
     const Json request = Json::parse(nextOfTag(phone, 22));
     EXPECT_EQ(request, Json({{"bytes", {22}}, {"deviceName", "Off****-PC"}, {"channel", 0}, {"id", 87654321},
                              {"open_Id", "openid-of-pc"}, {"service_id", "com.kesu.pcsuite.SERVICE"},
@@ -114,34 +135,6 @@ TEST_F(PreconnectTest, AcceptedHandshakeHoldsTheLinkAndAnswersThePhone) {
     phone.closeAll(true);
     ASSERT_TRUE(notices->waitFor(1, 5s));
     EXPECT_EQ(notices->ids(), std::vector<std::string>{entry->getDeviceId()});
-}
-
-// The kernel's keep-alive timer ("tr" 2 in /proc/net/tcp) of the PC's end of links to `port`,
-// in seconds; nullopt when there is no such link or its timer is another.
-std::optional<long> keepAliveSeconds(int port) {
-    std::ifstream table("/proc/net/tcp");
-    std::string line;
-    char remote[16];
-    std::snprintf(remote, sizeof remote, ":%04X ", port);
-    while (std::getline(table, line)) {
-        std::istringstream fields(line);
-        std::string slot, local, peer, state, queues, timer;
-        fields >> slot >> local >> peer >> state >> queues >> timer;
-        if ((peer + " ").find(remote) == std::string::npos || state != "01") continue;
-        if (timer.rfind("02:", 0) != 0) return std::nullopt;
-        return std::stol(timer.substr(3), nullptr, 16) / 100;  // jiffies as USER_HZ
-    }
-    return std::nullopt;
-}
-
-TEST_F(PreconnectTest, HeldLinkHasKeepAlive) {
-    phonesim::Listener phone(phoneOptions());
-    const auto entry = entryFor(phone.port());
-    ASSERT_EQ(handshake(entry), true);
-    const auto seconds = keepAliveSeconds(phone.port());
-    ASSERT_TRUE(seconds);
-    EXPECT_GT(*seconds, 20);
-    EXPECT_LE(*seconds, 30);
 }
 
 TEST_F(PreconnectTest, PcSuiteDownStillGivesThePhoneAnEmptyResult) {
@@ -235,9 +228,11 @@ TEST_F(PreconnectTest, FloodIsBoundedAndRequestsStillAnsweredPromptly) {
     EXPECT_EQ(loop.call([&] { return entry->queuedMessages(); }), std::optional<std::size_t>(8));
 }
 
-TEST_F(PreconnectTest, LinkEndsWithoutNoticeWhenTheRecordHasANewerLink) {
+// A disconnect request ends the held link with a notice; a newer link of the record ends it
+// without one.
+TEST_F(PreconnectTest, HeldLinkEndsWithANoticeOnlyWhenAskedTo) {
     phonesim::Listener phone(phoneOptions());
-    const auto entry = entryFor(phone.port());
+    auto entry = entryFor(phone.port());
     ASSERT_EQ(handshake(entry), true);
     const auto record = entry->getFarawayDevice();
     loop.call([&] {
@@ -248,15 +243,13 @@ TEST_F(PreconnectTest, LinkEndsWithoutNoticeWhenTheRecordHasANewerLink) {
     loop.call([] {});
     EXPECT_TRUE(notices->ids().empty());
     EXPECT_EQ(record->getClientId(), 2);
-}
 
-TEST_F(PreconnectTest, DisconnectRequestEndsTheHeldLinkWithANotice) {
-    phonesim::Listener phone(phoneOptions());
-    const auto entry = entryFor(phone.port());
+    phonesim::Listener second(phoneOptions());
+    entry = entryFor(second.port());
     ASSERT_EQ(handshake(entry), true);
     entry->setIsDisconnectNow(true);
     ASSERT_TRUE(notices->waitFor(1, 5s));
-    EXPECT_TRUE(phone.pcClosed(5s));
+    EXPECT_TRUE(second.pcClosed(5s));
 
     DeviceWaitForPreConnect orphan(loop);
     orphan.setConnectType(FarawayDevice::kWlan);
