@@ -20,6 +20,12 @@ phonesim::PreconnectReply modeReply(Mode mode) {
     reply.mode = mode;
     return reply;
 }
+// A reply whose `field` is `value`.
+phonesim::PreconnectReply replyWith(std::string phonesim::PreconnectReply::*field, const std::string& value) {
+    phonesim::PreconnectReply reply;
+    reply.*field = value;
+    return reply;
+}
 
 std::string stepEntry(const StepStruct& step, Result result) {
     return sharedStep().getConnectCodeV2(step) + sharedStep().getConnectResult(step, result);
@@ -160,19 +166,13 @@ TEST_F(PreconnectTest, RefusedHandshakes) {
         const StepStruct& failed;
         bool openIdSame = true;
     };
-    phonesim::PreconnectReply otherAccount;
-    otherAccount.openId = "someone-else";
-    phonesim::PreconnectReply otherDevice;
-    otherDevice.targetId = "OTHERPHONE";
-    phonesim::PreconnectReply blank;
-    blank.body = R"({"bytes": [23],"open_Id":"openid-of-pc","target_id":"SIMPHONE01"})";
-    phonesim::PreconnectReply wrongKind;
-    wrongKind.body = R"({"bytes":[1],"open_Id":"openid-of-pc","target_id":"SIMPHONE01"})";
+    const std::string blank = R"({"bytes": [23],"open_Id":"openid-of-pc","target_id":"SIMPHONE01"})";
+    const std::string wrongKind = R"({"bytes":[1],"open_Id":"openid-of-pc","target_id":"SIMPHONE01"})";
     const Case cases[] = {
-        {"other account", otherAccount, step.OS4_WLAN_PARSER_DEVICE_INFO, false},
-        {"other device", otherDevice, step.OS4_WLAN_PARSER_DEVICE_INFO},
-        {"blank in the kind", blank, step.OS4_WLAN_PARSER_DEVICE_INFO},
-        {"wrong kind", wrongKind, step.OS4_WLAN_PARSER_DEVICE_INFO},
+        {"other account", replyWith(&phonesim::PreconnectReply::openId, "someone-else"), step.OS4_WLAN_PARSER_DEVICE_INFO, false},
+        {"other device", replyWith(&phonesim::PreconnectReply::targetId, "OTHERPHONE"), step.OS4_WLAN_PARSER_DEVICE_INFO},
+        {"blank in the kind", replyWith(&phonesim::PreconnectReply::body, blank), step.OS4_WLAN_PARSER_DEVICE_INFO},
+        {"wrong kind", replyWith(&phonesim::PreconnectReply::body, wrongKind), step.OS4_WLAN_PARSER_DEVICE_INFO},
         {"silent", modeReply(Mode::Silent), step.OS4_WLAN_RECV_DEVICE_INFO},
         {"garbage", modeReply(Mode::Garbage), step.OS4_WLAN_RECV_DEVICE_INFO},
         {"half frame", modeReply(Mode::HalfFrame), step.OS4_WLAN_RECV_DEVICE_INFO},
