@@ -2,31 +2,21 @@
 // pre-connect registry: what each event sends and in which order, the throttle, and the
 // center's failures (down, refusing, slow, malformed or huge lists, a late list for an
 // account that is gone), none of which may reach the registry or hold up the loop.
-#include <gtest/gtest.h>
-
 #include <future>
 #include <string>
 #include <vector>
 
-#include "account/DataInstance.h"
 #include "cloud/HttpEventSubscriber.h"
-#include "core/Endpoints.h"
 #include "core/EventLoop.h"
-#include "core/Log.h"
 #include "platform/fake/FakePlatform.h"
 #include "preconnect/DeviceWaitForPreConnectManager.h"
-#include "support/StubPcSuite.h"
-#include "support/TestSupport.h"
 #include "support/UdpCatcher.h"
-#include "unit/UnitHelpers.h"
+#include "unit/cloud/CloudFixture.h"
 
 namespace kesu {
 namespace {
 
 using namespace std::chrono_literals;
-
-constexpr char kToken[] = "tok-91c4e7a2b05d3f";
-constexpr char kLastToken[] = "old-2d8f6b13e9c7a4";
 
 // A device-list reply naming phones of the four-character business ids `ids`, and a PC (never
 // an entry).
@@ -39,25 +29,13 @@ std::string listReply(const std::vector<std::string>& ids) {
     return Json{{"code", 0}, {"msg", "ok"}, {"data", data}}.dump();
 }
 
-class HttpEventSubscriberTest : public ::testing::Test {
+class HttpEventSubscriberTest : public test::CloudAccountTest {
 protected:
     void SetUp() override {
-        Log::closeLog();  // the day's file is opened again below this test's home
+        CloudAccountTest::SetUp();
         env.config().httpRequestTimeout = 5s;
         env.config().telemetryUdpPort = telemetry.port();
-        pcsuite.pointPcsuiteHere(env.config());
-        Endpoints::setConnectCenterServerUrl(center.baseUrl());
         fake->addAdapter("Wi-Fi", "wlan0", "aa:bb:cc:dd:ee:01", "10.0.0.5", "255.255.255.0");
-        saved = dataInstance().get();
-        dataInstance().update([](databaseParam& p) {
-            p = databaseParam{};
-            p.openid = "open-1";
-            p.token = kToken;
-            p.lastOpenId = "open-0";
-            p.lastToken = kLastToken;
-            p.pcDeviceId = "pc-1";
-            p.version = "1.2.3";
-        });
         center.setDefaultAnswer({200, R"({"code":0})"});
         center.setAnswer("/device/list", {200, listReply({})});
         loop.start();
@@ -66,13 +44,7 @@ protected:
         EXPECT_TRUE(subscriber->stop(10s));
         loop.stop();
         center.stop();
-        // Whatever a test did, the account's tokens never reach the log in clear.
-        const std::string log = test::todaysLog();
-        EXPECT_EQ(log.find(kToken), std::string::npos);
-        EXPECT_EQ(log.find(kLastToken), std::string::npos);
-        dataInstance().update([this](databaseParam& p) { p = saved; });
-        Endpoints::setConnectCenterServerUrl("");
-        Log::closeLog();
+        CloudAccountTest::TearDown();
     }
 
     // Publishes `event` to the subscriber and waits until it has been handled.
@@ -85,12 +57,8 @@ protected:
         for (const auto& request : center.requests()) out.push_back(request.path);
         return out;
     }
-    test::HermeticEnv env;
     ScopedFakePlatform fake;
     test::UdpCatcher telemetry;
-    test::StubPcSuite center;
-    test::StubPcSuite pcsuite;
-    databaseParam saved;
     EventLoop loop;
     DeviceWaitForPreConnectManager registry{&loop};
     ManualClock clock;
@@ -102,9 +70,6 @@ TEST_F(HttpEventSubscriberTest, AccountChangeUnbindsReportsAndFetchesInThatOrder
     handle(ServiceEvent::AccountChange);
 
     EXPECT_EQ(paths(), (std::vector<std::string>{"/device/unBind", "/device/report", "/device/list"}));
-    const auto unbind = center.requestsTo("/device/unBind").at(0);
-    EXPECT_EQ(unbind.header("userId"), "open-0");  // the previous account
-    EXPECT_EQ(Json::parse(unbind.body), Json::parse(R"(["pc-1"])"));
     const Json report = Json::parse(center.requestsTo("/device/report").at(0).body);
     EXPECT_EQ(report[0]["userId"], "open-1");
     EXPECT_EQ(report[0]["inets"][0]["localInet"], "10.0.0.5");

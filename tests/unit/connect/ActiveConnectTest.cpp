@@ -20,7 +20,6 @@ using namespace std::chrono_literals;
 using test::control;
 using Phone = phonesim::Listener;
 
-// A phone on loopback that answers with `body` (silent or hanging up when told).
 Phone::Options answering(phonesim::Answer answer, std::string body = "") {
     Phone::Options options;
     options.answer = answer;
@@ -31,8 +30,7 @@ constexpr auto kAnswer = phonesim::Answer::Accept;
 constexpr auto kSilent = phonesim::Answer::Silent;
 constexpr auto kHangUp = phonesim::Answer::HangUp;
 
-// Far beyond what any of these exchanges needs; a wait that ends well before it ended by its
-// event.
+// Far beyond any exchange here; a wait that ends well before it ended by its event.
 constexpr auto kLong = 120s;
 constexpr auto kWellBeforeLong = 60s;
 
@@ -81,58 +79,39 @@ TEST_F(ActiveConnectTest, PhoneAgreesWithTheRequestOnTheWire) {
     EXPECT_TRUE(ConnectionState::getWlanConnState());
 }
 
-TEST_F(ActiveConnectTest, PhoneRefusesIsBusyOrSaysSomethingElse) {
+// Every answer but agreement, silence and a hang-up; the link is closed after each.
+TEST_F(ActiveConnectTest, RefusalBusyOtherAnswersSilenceHangUpAndNoListener) {
+    const std::string timedOut = "[SSDP search] connect timeout or phone wake up pcsuite failed.";
     struct Case {
-        std::string answer;
+        const char* name;
+        Phone::Options phone;
         int error;
-        std::string message;
-        std::string steps;
+        std::string message, steps;
     };
     const std::vector<Case> cases = {
-        {R"({"bytes":[2]})", -10004, "[SSDP search] phone reject the connect.", "_WI:0_WF:0_TF:0_WO:-3"},
-        {R"({"bytes":[11]})", -10001, "[SSDP search] phone is busy.", "_WI:0_WF:0_TF:0_WO:-2"},
-        {R"({"bytes":[23]})", -10007, "[SSDP search] connect timeout or phone wake up pcsuite failed.",
-         "_WI:0_WF:0_TF:0_WO:-1"},
-        {"{\"bytes\":[1],\"x\":\"\xff\"}", -10007, "[SSDP search] connect timeout or phone wake up pcsuite failed.",
-         "_WI:0_WF:0_TF:0_WO:-1"},  // not UTF-8: nothing to classify
+        {"refused", answering(kAnswer, R"({"bytes":[2]})"), -10004, "[SSDP search] phone reject the connect.", "-3"},
+        {"busy", answering(kAnswer, R"({"bytes":[11]})"), -10001, "[SSDP search] phone is busy.", "-2"},
+        {"other tag", answering(kAnswer, R"({"bytes":[23]})"), -10007, timedOut, "-1"},
+        {"not UTF-8", answering(kAnswer, "{\"bytes\":[1],\"x\":\"\xff\"}"), -10007, timedOut, "-1"},
+        {"silent", answering(kSilent), -10007, timedOut, "-1"},
+        {"hang-up", answering(kHangUp), -10007, timedOut, "-1"},
     };
     for (const Case& c : cases) {
-        Phone phone(answering(kAnswer, c.answer));
+        SCOPED_TRACE(c.name);
+        env.config().activeConnectTimeout = c.phone.answer == kSilent ? 300ms : kLong;
+        Phone phone(c.phone);
         usePhone(phone);
-        const Json reply = connect("d1");
-        EXPECT_EQ(reply, (Json{{"error", c.error}, {"error_message", c.message}, {"connection_steps", c.steps}}))
-            << c.answer;
-        EXPECT_TRUE(phone.pcClosed(kWellBeforeLong)) << c.answer;
+        EXPECT_EQ(connect("d1"), (Json{{"error", c.error},
+                                       {"error_message", c.message},
+                                       {"connection_steps", "_WI:0_WF:0_TF:0_WO:" + c.steps}}));
+        if (c.phone.answer != kHangUp) {
+            EXPECT_TRUE(phone.pcClosed(kWellBeforeLong));
+        }
     }
-}
-
-TEST_F(ActiveConnectTest, SilenceHangUpAndRefusedConnectAreTimeouts) {
-    const Json timeout = {{"error", -10007},
-                          {"error_message", "[SSDP search] connect timeout or phone wake up pcsuite failed."},
-                          {"connection_steps", "_WI:0_WF:0_TF:0_WO:-1"}};
-    {
-        env.config().activeConnectTimeout = 300ms;
-        Phone phone(answering(kSilent));
-        usePhone(phone);
-        EXPECT_EQ(connect("d1"), timeout);
-        EXPECT_TRUE(phone.pcClosed(kWellBeforeLong));
-        env.config().activeConnectTimeout = kLong;
-    }
-    {
-        // The phone hangs up without answering: no answer can come any more.
-        Phone phone(answering(kHangUp));
-        usePhone(phone);
-        EXPECT_EQ(connect("d1"), timeout);
-    }
-    {
-        // Nothing listens on the phone's port: the connect step failed.
-        env.config().phoneTcpPort = test::freeTcpPort();
-        addDevice("d1", {"127.0.0.1"});
-        Json refused = timeout;
-        refused["connection_steps"] = "_WI:0_WF:0_TF:-1";
-        EXPECT_EQ(connect("d1"), refused);
-        EXPECT_FALSE(ConnectionState::getWlanConnState());
-    }
+    // Nothing listens on the phone's port: the connect step failed.
+    env.config().phoneTcpPort = test::freeTcpPort();
+    EXPECT_EQ(connect("d1"), (Json{{"error", -10007}, {"error_message", timedOut}, {"connection_steps", "_WI:0_WF:0_TF:-1"}}));
+    EXPECT_FALSE(ConnectionState::getWlanConnState());
 }
 
 // An unknown device's answer is checked end to end (ConnectE2E).

@@ -23,7 +23,6 @@
 #include "core/EventLoop.h"
 #include "core/Json.h"
 #include "core/Log.h"
-#include "support/TestSupport.h"
 #include "platform/fake/FakePlatform.h"
 #include "support/TestSupport.h"
 
@@ -83,13 +82,10 @@ inline int listenLoopback(int& port, int backlog = 16) {
     return fd;
 }
 
-// Waits for `fd` to become readable; false when `stopFd` fired or the time-out passed first.
-inline bool readable(int fd, int stopFd, std::chrono::milliseconds timeout) {
-    pollfd fds[2] = {{fd, POLLIN, 0}, {stopFd, POLLIN, 0}};
-    const int n = ::poll(fds, stopFd >= 0 ? 2 : 1, static_cast<int>(timeout.count()));
-    if (n <= 0) return false;
-    if (stopFd >= 0 && fds[1].revents != 0) return false;
-    return fds[0].revents != 0;
+// Waits for `fd` to become readable; false at the time-out.
+inline bool readable(int fd, std::chrono::milliseconds timeout) {
+    pollfd pfd{fd, POLLIN, 0};
+    return ::poll(&pfd, 1, static_cast<int>(timeout.count())) > 0;
 }
 
 // A program at `path` (an executable script written there) that sends its arguments, each
@@ -100,23 +96,19 @@ public:
     explicit LaunchRecorder(const std::string& path) {
         listenFd_ = listenLoopback(port_);
         std::filesystem::create_directories(std::filesystem::path(path).parent_path());
-        {
-            std::ofstream script(path, std::ios::trunc);
-            script << "#!/bin/bash\n"
-                   << "exec 3<>/dev/tcp/127.0.0.1/" << port_ << " || exit 1\n"
-                   << "printf '%s\\0' \"$@\" >&3\n";
-        }
+        std::ofstream(path, std::ios::trunc) << "#!/bin/bash\nexec 3<>/dev/tcp/127.0.0.1/" << port_
+                                              << " || exit 1\nprintf '%s\\0' \"$@\" >&3\n";
         std::filesystem::permissions(path, std::filesystem::perms::owner_all);
     }
     ~LaunchRecorder() { ::close(listenFd_); }
 
     // The arguments of the next start; nullopt when none came in time.
     std::optional<std::vector<std::string>> next(std::chrono::milliseconds timeout) {
-        if (!readable(listenFd_, -1, timeout)) return std::nullopt;
+        if (!readable(listenFd_, timeout)) return std::nullopt;
         const int link = ::accept4(listenFd_, nullptr, nullptr, SOCK_CLOEXEC);
         std::string data;
         char buffer[4096];
-        while (readable(link, -1, timeout)) {
+        while (readable(link, timeout)) {
             const ssize_t n = ::recv(link, buffer, sizeof buffer, 0);
             if (n <= 0) break;
             data.append(buffer, static_cast<std::size_t>(n));

@@ -28,15 +28,13 @@ protected:
         link = std::make_unique<PhoneLink>(loop.executor());
     }
 
-    // Runs a step of the link on the loop and waits for its result.
-    template <class T>
-    T run(asio::awaitable<T> step) {
-        return asio::co_spawn(loop.executor(), std::move(step), asio::use_future).get();
-    }
+    // A step of the link on the loop: started, or run to its result.
     template <class T>
     std::future<T> start(asio::awaitable<T> step) {
         return asio::co_spawn(loop.executor(), std::move(step), asio::use_future);
     }
+    template <class T>
+    T run(asio::awaitable<T> step) { return start(std::move(step)).get(); }
     static PhoneLink::Clock::time_point in(std::chrono::milliseconds time) { return PhoneLink::Clock::now() + time; }
 
     // A connected link and the phone's end of it.

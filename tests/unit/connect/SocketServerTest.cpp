@@ -28,14 +28,12 @@ using Phone = phonesim::Link;
 constexpr auto kLong = 120s;
 constexpr auto kWait = 60s;  // how long a test phone waits for an answer
 
-void drainAllowAnswers() { allowWindowAnswers().drain(); }
-
 class PhoneServer : public test::PcIdentityTest {
 protected:
     void SetUp() override {
         PcIdentityTest::SetUp();
         loop.start();
-        drainAllowAnswers();
+        allowWindowAnswers().drain();
         dataInstance().set(&databaseParam::storageDir, "/data/recv");
         Config& config = env.config();
         config.phoneServerHost = "127.0.0.1";
@@ -46,7 +44,7 @@ protected:
         pcsuite.pointPcsuiteHere(config);
         window = std::make_unique<test::LaunchRecorder>(rootedPath(config.connectStatusExecutable));
     }
-    // Starts the server once the test has set its configuration (its threads read it).
+    // Once the test has set its configuration (the server's threads read it).
     void startServer() {
         if (server.port() > 0) return;
         ASSERT_TRUE(ServerWorkAct(server).ServerAccept());
@@ -54,7 +52,7 @@ protected:
     }
     void TearDown() override {
         server.stop();
-        drainAllowAnswers();
+        allowWindowAnswers().drain();
         PcIdentityTest::TearDown();
     }
 
@@ -76,7 +74,7 @@ protected:
     }
     std::unique_ptr<Phone> send(const Bytes& frame) {
         auto phone = dial();
-        EXPECT_TRUE(phone->send(frame));
+        EXPECT_TRUE(phone && phone->send(frame));
         return phone;
     }
     std::unique_ptr<Phone> send(const Json& body) { return send(buildPhoneFrame(body.dump())); }
@@ -197,10 +195,8 @@ TEST_F(PhoneServer, BusyPcSuiteAnswersByDeviceType) {
                       {200, R"({"code":"000000","data":{"isConnectBusy":true,"deviceType":"phone","connectStatus":"connected"}})"});
     auto phone = send(request("com.kesu.pcsuite.SERVICE", 0));
     EXPECT_EQ(answer(*phone)["bytes"], Json::array({11}));
-    EXPECT_TRUE(closedByServer(*phone));
     auto pad = send(request("com.kesu.pcsuite.SERVICE", 1));
     EXPECT_EQ(answer(*pad)["bytes"], Json::array({12}));
-    EXPECT_TRUE(closedByServer(*pad));
     ASSERT_TRUE(server.waitForNoLinks(kLong));
     EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());
     EXPECT_EQ(test::todaysLog().find("[startAllowedWindow]"), std::string::npos);  // no window for a busy PC suite
@@ -240,9 +236,8 @@ TEST_F(PhoneServer, SharingRequestsSkipTheAllowWindow) {
 TEST_F(PhoneServer, BadInputIsDroppedAndEveryLinkIsClosed) {
     env.config().phoneLinkReadTimeout = 300ms;
     env.config().phoneFrameMaxBody = 1024;
-    Bytes oversized = buildPhoneFrame(std::string(2000, ' '));
     const std::vector<Bytes> frames = {
-        oversized,                                                 // a body above the limit
+        buildPhoneFrame(std::string(2000, ' ')),                                                 // a body above the limit
         buildPhoneFrame(""),                                       // 14 bytes: no body
         buildPhoneFrame("{\"bytes\":[0],\"x\":\"\xff\xfe\"}"),     // not UTF-8
         buildPhoneFrame("[0]"),                                    // not an object
@@ -258,7 +253,6 @@ TEST_F(PhoneServer, BadInputIsDroppedAndEveryLinkIsClosed) {
     auto silent = dial();
     EXPECT_TRUE(closedByServer(*silent));  // after the read time-out
     ASSERT_TRUE(server.waitForNoLinks(kLong));
-    EXPECT_EQ(server.linkCount(), 0u);
     EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());
     EXPECT_TRUE(pcsuite.requests().empty());
 }
@@ -282,15 +276,11 @@ TEST_F(PhoneServer, LinksAreBoundedAndStopEndsThem) {
     EXPECT_EQ(server.port(), 0);
     EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());
 
-    // The server opens again.
+    // The server opens again; a second server on its port reports the port in use.
     ASSERT_TRUE(server.ConnectStatusGet());
     auto again = send(request("com.kesu.share.CONNECT_PC", 0));
     EXPECT_EQ(answer(*again)["bytes"], Json::array({3}));
     ASSERT_TRUE(window->next(kLong));
-}
-
-TEST_F(PhoneServer, PortInUseIsReported) {
-    startServer();
     env.config().phoneServerPort = server.port();
     SocketServer second{loop};
     EXPECT_FALSE(second.ConnectStatusGet());

@@ -24,10 +24,8 @@ process::RunResult heartBeatAs(const std::string& user, int port) {
     std::vector<std::string> args;
     if (!user.empty()) args = {"--reuid=" + user, "--regid=nogroup", "--clear-groups", "curl"};
     const std::string body = R"({"event":"HeartBeat","args":[0]})";
-    for (const std::string& a : {std::string("-q"), std::string("-sS"), std::string("--max-time"), std::string("10"),
-                                 std::string("--data-binary"), std::to_string(body.size()) + "#" + body,
-                                 "http://127.0.0.1:" + std::to_string(port) + "/"})
-        args.push_back(a);
+    args.insert(args.end(), {"-q", "-sS", "--max-time", "10", "--data-binary", std::to_string(body.size()) + "#" + body,
+                             "http://127.0.0.1:" + std::to_string(port) + "/"});
     auto result = process::run(user.empty() ? "curl" : "setpriv", args, 20s);
     EXPECT_TRUE(result.has_value());
     return result.value_or(process::RunResult{});

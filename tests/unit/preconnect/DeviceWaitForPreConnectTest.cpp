@@ -20,6 +20,12 @@ phonesim::PreconnectReply modeReply(Mode mode) {
     reply.mode = mode;
     return reply;
 }
+// A reply whose `field` is `value`.
+phonesim::PreconnectReply replyWith(std::string phonesim::PreconnectReply::*field, const std::string& value) {
+    phonesim::PreconnectReply reply;
+    reply.*field = value;
+    return reply;
+}
 
 std::string stepEntry(const StepStruct& step, Result result) {
     return sharedStep().getConnectCodeV2(step) + sharedStep().getConnectResult(step, result);
@@ -35,7 +41,6 @@ TEST(FarawayDeviceTest, CloudRecordBecomesTheRecordAndItsLocalForm) {
     const Json local = device.getLocalInfo();
     EXPECT_EQ(device.getDeviceId(), "61626364");  // only the first four characters count
     EXPECT_EQ(local["type"], "unknowed");
-    EXPECT_EQ(local["btSwitch"], 1);
     EXPECT_EQ(local["wifiSwitch"], 0);  // a missing key reads as 0
     EXPECT_EQ(local["ext"], Json({{"k", {1, 2}}}));
     ASSERT_EQ(local["inets"].size(), 3u);
@@ -71,6 +76,24 @@ TEST(FarawayDeviceTest, ClientGenerations) {
     device.destroyClient();
 }
 
+// The kernel's keep-alive timer ("tr" 2 in /proc/net/tcp) of the PC's end of links to `port`,
+// in seconds; nullopt when there is no such link or its timer is another.
+std::optional<long> keepAliveSeconds(int port) {
+    std::ifstream table("/proc/net/tcp");
+    std::string line;
+    char remote[16];
+    std::snprintf(remote, sizeof remote, ":%04X ", port);
+    while (std::getline(table, line)) {
+        std::istringstream fields(line);
+        std::string slot, local, peer, state, queues, timer;
+        fields >> slot >> local >> peer >> state >> queues >> timer;
+        if ((peer + " ").find(remote) == std::string::npos || state != "01") continue;
+        if (timer.rfind("02:", 0) != 0) return std::nullopt;
+        return std::stol(timer.substr(3), nullptr, 16) / 100;  // jiffies as USER_HZ
+    }
+    return std::nullopt;
+}
+
 TEST_F(PreconnectTest, AcceptedHandshakeHoldsTheLinkAndAnswersThePhone) {
     pcsuite.setAnswer("/connectDevice", {200, R"({"code":"000000","data":{"code":7,"reason":"shown"}})"});
     phonesim::Listener phone(phoneOptions());
@@ -82,6 +105,10 @@ TEST_F(PreconnectTest, AcceptedHandshakeHoldsTheLinkAndAnswersThePhone) {
     EXPECT_EQ(entry->getPreConnectStep(), stepEntry(sharedStep().OS4_WLAN_PING_ADDRESS, Result::FAILED));
     EXPECT_EQ(entry->getWlanDeviceIp(), "127.0.0.1");
     EXPECT_TRUE(entry->getIsOpenIdSame());
+    const auto keepAlive = keepAliveSeconds(phone.port());  // the held link has keep-alive
+    ASSERT_TRUE(keepAlive);
+    EXPECT_GT(*keepAlive, 20);
+    EXPECT_LE(*keepAlive, 30);
     const Json request = Json::parse(nextOfTag(phone, 22));
     EXPECT_EQ(request, Json({{"bytes", {22}}, {"deviceName", "Off****-PC"}, {"channel", 0}, {"id", 87654321},
                              {"open_Id", "openid-of-pc"}, {"service_id", "com.kesu.pcsuite.SERVICE"},
@@ -116,44 +143,21 @@ TEST_F(PreconnectTest, AcceptedHandshakeHoldsTheLinkAndAnswersThePhone) {
     EXPECT_EQ(notices->ids(), std::vector<std::string>{entry->getDeviceId()});
 }
 
-// The kernel's keep-alive timer ("tr" 2 in /proc/net/tcp) of the PC's end of links to `port`,
-// in seconds; nullopt when there is no such link or its timer is another.
-std::optional<long> keepAliveSeconds(int port) {
-    std::ifstream table("/proc/net/tcp");
-    std::string line;
-    char remote[16];
-    std::snprintf(remote, sizeof remote, ":%04X ", port);
-    while (std::getline(table, line)) {
-        std::istringstream fields(line);
-        std::string slot, local, peer, state, queues, timer;
-        fields >> slot >> local >> peer >> state >> queues >> timer;
-        if ((peer + " ").find(remote) == std::string::npos || state != "01") continue;
-        if (timer.rfind("02:", 0) != 0) return std::nullopt;
-        return std::stol(timer.substr(3), nullptr, 16) / 100;  // jiffies as USER_HZ
-    }
-    return std::nullopt;
-}
-
-TEST_F(PreconnectTest, HeldLinkHasKeepAlive) {
-    phonesim::Listener phone(phoneOptions());
-    const auto entry = entryFor(phone.port());
-    ASSERT_EQ(handshake(entry), true);
-    const auto seconds = keepAliveSeconds(phone.port());
-    ASSERT_TRUE(seconds);
-    EXPECT_GT(*seconds, 20);
-    EXPECT_LE(*seconds, 30);
-}
-
-TEST_F(PreconnectTest, PcSuiteDownStillGivesThePhoneAnEmptyResult) {
+// A flood of frames is bounded, a request behind it is still answered, and with the PC suite
+// down the phone still gets an (empty) result.
+TEST_F(PreconnectTest, FloodIsBoundedAndPcSuiteDownStillGivesAnEmptyResult) {
     env.config().pcsuitePort = test::freeTcpPort();
+    env.config().preconnectQueueMaxFrames = 8;
     phonesim::Listener phone(phoneOptions());
     const auto entry = entryFor(phone.port());
     ASSERT_EQ(handshake(entry), true);
+    ASSERT_TRUE(phone.sendToAll(R"({"bytes":[30],"pad":")" + std::string(1000, 'x') + "\"}", 3000));
     ASSERT_TRUE(phone.sendToAll(R"({"bytes":[24]})"));
     ASSERT_FALSE(nextOfTag(phone, 25).empty());
     const std::string result = nextOfTag(phone, 27);
     ASSERT_FALSE(result.empty());
     EXPECT_EQ(Json::parse(result)["extra_info"], "{}");
+    EXPECT_EQ(loop.call([&] { return entry->queuedMessages(); }), std::optional<std::size_t>(8));
 }
 
 // Every way a phone can fail the handshake ends the attempt within the time-outs, names the
@@ -167,19 +171,13 @@ TEST_F(PreconnectTest, RefusedHandshakes) {
         const StepStruct& failed;
         bool openIdSame = true;
     };
-    phonesim::PreconnectReply otherAccount;
-    otherAccount.openId = "someone-else";
-    phonesim::PreconnectReply otherDevice;
-    otherDevice.targetId = "OTHERPHONE";
-    phonesim::PreconnectReply blank;
-    blank.body = R"({"bytes": [23],"open_Id":"openid-of-pc","target_id":"SIMPHONE01"})";
-    phonesim::PreconnectReply wrongKind;
-    wrongKind.body = R"({"bytes":[1],"open_Id":"openid-of-pc","target_id":"SIMPHONE01"})";
+    const std::string blank = R"({"bytes": [23],"open_Id":"openid-of-pc","target_id":"SIMPHONE01"})";
+    const std::string wrongKind = R"({"bytes":[1],"open_Id":"openid-of-pc","target_id":"SIMPHONE01"})";
     const Case cases[] = {
-        {"other account", otherAccount, step.OS4_WLAN_PARSER_DEVICE_INFO, false},
-        {"other device", otherDevice, step.OS4_WLAN_PARSER_DEVICE_INFO},
-        {"blank in the kind", blank, step.OS4_WLAN_PARSER_DEVICE_INFO},
-        {"wrong kind", wrongKind, step.OS4_WLAN_PARSER_DEVICE_INFO},
+        {"other account", replyWith(&phonesim::PreconnectReply::openId, "someone-else"), step.OS4_WLAN_PARSER_DEVICE_INFO, false},
+        {"other device", replyWith(&phonesim::PreconnectReply::targetId, "OTHERPHONE"), step.OS4_WLAN_PARSER_DEVICE_INFO},
+        {"blank in the kind", replyWith(&phonesim::PreconnectReply::body, blank), step.OS4_WLAN_PARSER_DEVICE_INFO},
+        {"wrong kind", replyWith(&phonesim::PreconnectReply::body, wrongKind), step.OS4_WLAN_PARSER_DEVICE_INFO},
         {"silent", modeReply(Mode::Silent), step.OS4_WLAN_RECV_DEVICE_INFO},
         {"garbage", modeReply(Mode::Garbage), step.OS4_WLAN_RECV_DEVICE_INFO},
         {"half frame", modeReply(Mode::HalfFrame), step.OS4_WLAN_RECV_DEVICE_INFO},
@@ -224,20 +222,11 @@ TEST_F(PreconnectTest, NoListenerFailsAtTheConnectStep) {
     EXPECT_EQ(entry->getFarawayWlanConnectCount(), 0);
 }
 
-TEST_F(PreconnectTest, FloodIsBoundedAndRequestsStillAnsweredPromptly) {
-    env.config().preconnectQueueMaxFrames = 8;
+// A disconnect request ends the held link with a notice; a newer link of the record ends it
+// without one.
+TEST_F(PreconnectTest, HeldLinkEndsWithANoticeOnlyWhenAskedTo) {
     phonesim::Listener phone(phoneOptions());
-    const auto entry = entryFor(phone.port());
-    ASSERT_EQ(handshake(entry), true);
-    ASSERT_TRUE(phone.sendToAll(R"({"bytes":[30],"pad":")" + std::string(1000, 'x') + "\"}", 3000));
-    ASSERT_TRUE(phone.sendToAll(R"({"bytes":[24]})"));
-    EXPECT_FALSE(nextOfTag(phone, 25).empty());
-    EXPECT_EQ(loop.call([&] { return entry->queuedMessages(); }), std::optional<std::size_t>(8));
-}
-
-TEST_F(PreconnectTest, LinkEndsWithoutNoticeWhenTheRecordHasANewerLink) {
-    phonesim::Listener phone(phoneOptions());
-    const auto entry = entryFor(phone.port());
+    auto entry = entryFor(phone.port());
     ASSERT_EQ(handshake(entry), true);
     const auto record = entry->getFarawayDevice();
     loop.call([&] {
@@ -248,15 +237,13 @@ TEST_F(PreconnectTest, LinkEndsWithoutNoticeWhenTheRecordHasANewerLink) {
     loop.call([] {});
     EXPECT_TRUE(notices->ids().empty());
     EXPECT_EQ(record->getClientId(), 2);
-}
 
-TEST_F(PreconnectTest, DisconnectRequestEndsTheHeldLinkWithANotice) {
-    phonesim::Listener phone(phoneOptions());
-    const auto entry = entryFor(phone.port());
+    phonesim::Listener second(phoneOptions());
+    entry = entryFor(second.port());
     ASSERT_EQ(handshake(entry), true);
     entry->setIsDisconnectNow(true);
     ASSERT_TRUE(notices->waitFor(1, 5s));
-    EXPECT_TRUE(phone.pcClosed(5s));
+    EXPECT_TRUE(second.pcClosed(5s));
 
     DeviceWaitForPreConnect orphan(loop);
     orphan.setConnectType(FarawayDevice::kWlan);

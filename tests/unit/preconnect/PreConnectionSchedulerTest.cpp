@@ -44,6 +44,15 @@ protected:
         return entry;
     }
 
+    // An entry of the simulated phone `phone` in `registry`, its link held.
+    std::shared_ptr<DeviceWaitForPreConnect> held(DeviceWaitForPreConnectManager& registry, phonesim::Listener& phone) {
+        env.config().phoneTcpPort = phone.port();
+        const auto entry = add(registry, loop, "SIMP", "2026-12-06 10:00:00.000");
+        entry->setConnectType(FarawayDevice::kWlan);
+        EXPECT_EQ(handshake(entry), true);
+        return entry;
+    }
+
     // The next telemetry record of `eventId`; null at the time-out.
     Json nextRecord(const std::string& eventId) {
         while (auto datagram = collector.receive(5s)) {
@@ -133,10 +142,7 @@ TEST_F(SchedulerTest, PcEventsAdjustEveryEntry) {
     DeviceWaitForPreConnectManager registry(&loop);
     PreConnectEventSubscriber subscriber(loop, registry);
     phonesim::Listener phone(phoneOptions());
-    env.config().phoneTcpPort = phone.port();
-    const auto held = add(registry, loop, "SIMP", "2026-12-06 10:00:00.000", 0);
-    held->setConnectType(FarawayDevice::kWlan);
-    ASSERT_EQ(handshake(held), true);
+    const auto link = held(registry, phone);
     const auto failed = add(registry, loop, "AAAA", "2026-12-06 10:00:00.000", 2);
 
     subscriber.eventNotify(ServiceEvent::Pcsuite);
@@ -145,30 +151,26 @@ TEST_F(SchedulerTest, PcEventsAdjustEveryEntry) {
     EXPECT_EQ(failed->getFarawayWlanConnectCount(), 0);
     subscriber.eventNotify(ServiceEvent::NetworkChange);  // held links end
     EXPECT_TRUE(phone.pcClosed(5s));
-    held->setFirstConnect(false);
+    link->setFirstConnect(false);
     subscriber.eventNotify(ServiceEvent::AccountChange);  // still signed in
-    EXPECT_TRUE(held->getFirstConnect());
+    EXPECT_TRUE(link->getFirstConnect());
     EXPECT_EQ(registry.getDevicesSize(), 2);
     dataInstance().set(&databaseParam::openid, "");
     subscriber.eventNotify(ServiceEvent::AccountChange);  // signed out
     EXPECT_EQ(registry.getDevicesSize(), 0);
-    EXPECT_FALSE(held->getIsConnected());
+    EXPECT_FALSE(link->getIsConnected());
 }
 
 TEST_F(SchedulerTest, AnotherAccountSigningInEndsEveryHeldLinkOfThePrevious) {
     DeviceWaitForPreConnectManager registry(&loop);
     PreConnectEventSubscriber subscriber(loop, registry);
     phonesim::Listener phone(phoneOptions());
-    env.config().phoneTcpPort = phone.port();
-    const auto held = add(registry, loop, "SIMP", "2026-12-06 10:00:00.000", 0);
-    held->setConnectType(FarawayDevice::kWlan);
-    ASSERT_EQ(handshake(held), true);
-
+    const auto link = held(registry, phone);
     dataInstance().set(&databaseParam::openid, "openid-of-someone-else");
     subscriber.eventNotify(ServiceEvent::AccountChange);  // no sign-out in between, no new list yet
     EXPECT_TRUE(phone.pcClosed(5s));
     EXPECT_EQ(registry.getDevicesSize(), 0);
-    EXPECT_FALSE(held->getIsConnected());
+    EXPECT_FALSE(link->getIsConnected());
 }
 
 TEST_F(SchedulerTest, DeviceDroppedDuringItsHandshakeKeepsNoLink) {
