@@ -44,9 +44,10 @@ std::optional<std::string> findHeader(const ConnectCenterRequest::Headers& heade
 
 // `base` with `extra` laid over it; header names compare without case.
 ConnectCenterRequest::Headers merged(ConnectCenterRequest::Headers base, const ConnectCenterRequest::Headers& extra) {
-    for (const auto& [name, value] : extra) {
+    for (const auto& header : extra) {
+        const std::string& name = header.first;  // a named copy: lambdas may not capture bindings (clang 14)
         std::erase_if(base, [&](const auto& pair) { return sameName(pair.first, name); });
-        base[name] = value;
+        base[name] = header.second;
     }
     return base;
 }

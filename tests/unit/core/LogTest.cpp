@@ -38,7 +38,8 @@ public:
 };
 
 WallClock::Clock::time_point utc(int y, int mo, int d, int h, int mi, int s, int ms) {
-    std::tm tm{.tm_sec = s, .tm_min = mi, .tm_hour = h, .tm_mday = d, .tm_mon = mo - 1, .tm_year = y - 1900};
+    std::tm tm{};
+    tm.tm_sec = s, tm.tm_min = mi, tm.tm_hour = h, tm.tm_mday = d, tm.tm_mon = mo - 1, tm.tm_year = y - 1900;
     return WallClock::Clock::from_time_t(timegm(&tm)) + std::chrono::milliseconds(ms);
 }
 

@@ -114,7 +114,9 @@ TEST(PeerOwner, ConnectionsMadeByAnotherUser) {
         if (!acceptFirst) nobody.end();
         const int served = listener.accept();
         std::string why;
-        if (acceptFirst) EXPECT_EQ(peer::connectedPeerOwner(served, &why), nobody.uid()) << why;
+        if (acceptFirst) {
+            EXPECT_EQ(peer::connectedPeerOwner(served, &why), nobody.uid()) << why;
+        }
         nobody.end();
         EXPECT_EQ(peer::connectedPeerOwner(served), std::nullopt);
         ::close(served);
