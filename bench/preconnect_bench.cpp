@@ -242,6 +242,7 @@ int run(const test::NetNsLab::Node& pc, const test::NetNsLab::Node& phone, int s
         phonesim::Listener::Options options;
         options.host = phone.ip;
         options.preconnect = phonesim::PreconnectReply{};
+        options.answer = phonesim::Answer::Silent;
         echoPhone = std::make_unique<phonesim::Listener>(options, [&echoLog](const auto& e) { echoLog.onEvent(e); });
     });
     for (const auto& listener : phones.listeners)

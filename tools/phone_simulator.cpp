@@ -23,7 +23,11 @@
 //   --preconnect answer|silent|garbage|half|huge|hangup
 //                        with --tcp-port: play a phone of the account that a PC pre-connects;
 //                        its request ([22]) gets a reply ([23] with --openid and --id, or a
-//                        broken one) and the link is held; prints "SIM TCP_ANSWERED 23"
+//                        broken one) and the link is held; prints "SIM TCP_ANSWERED 23";
+//                        a fresh link's request gets --answer only when that is given
+//   --held-answer accept|reject|busy|silent
+//                        with --preconnect: answer to a connection request ([0]) on a held
+//                        link (default: none)
 //   --ask-connect-after S  with --preconnect: S seconds after the start, ask the PC over every
 //                        held link to be connected ([24]); prints "SIM PRECONNECT_ASKED"
 //   --close-after S      with --tcp-port: close every link S seconds after the start; prints
@@ -60,7 +64,8 @@ struct Options {
     int announceEvery = -1;
     bool listen = false;
     int tcpPort = 0;
-    std::string answer = "accept";
+    std::string answer;  // accept, or silent for a pre-connecting phone
+    std::string heldAnswer;
     std::string connect;
     std::string service = "com.kesu.pcsuite.SERVICE";
     std::string preconnect;
@@ -93,7 +98,7 @@ void usage() {
     std::cout << "phone_simulator [--iface-ip IP] [--name N] [--id I] [--account A] [--openid O]\n"
                  "  [--guide G] [--type mobile|pad] [--format current|old] [--announce-every S]\n"
                  "  [--listen] [--tcp-port P] [--answer accept|reject|busy|silent]\n"
-                 "  [--preconnect answer|silent|garbage|half|huge|hangup] [--ask-connect-after S]\n"
+                 "  [--preconnect answer|silent|garbage|half|huge|hangup] [--held-answer A] [--ask-connect-after S]\n"
                  "  [--close-after S] [--connect HOST:PORT] [--service S] [--duration S] [--help]\n";
 }
 
@@ -101,7 +106,8 @@ bool parse(int argc, char** argv, Options& o) {
     std::map<std::string, std::string*> text{{"--iface-ip", &o.ifaceIp}, {"--name", &o.phone.name},
         {"--id", &o.phone.id}, {"--account", &o.phone.account}, {"--openid", &o.phone.openId},
         {"--guide", &o.phone.guide}, {"--type", &o.phone.type}, {"--format", &o.format}, {"--answer", &o.answer},
-        {"--connect", &o.connect}, {"--service", &o.service}, {"--preconnect", &o.preconnect}};
+        {"--connect", &o.connect}, {"--service", &o.service}, {"--preconnect", &o.preconnect},
+        {"--held-answer", &o.heldAnswer}};
     std::map<std::string, int*> number{{"--announce-every", &o.announceEvery}, {"--tcp-port", &o.tcpPort},
         {"--duration", &o.duration}, {"--ask-connect-after", &o.askConnectAfter}, {"--close-after", &o.closeAfter}};
     for (int i = 1; i < argc; ++i) {
@@ -175,7 +181,11 @@ int main(int argc, char** argv) {
         if (!o.preconnect.empty()) {
             const auto mode = preconnectModeNamed(o.preconnect);
             if (!mode) { std::cerr << "unknown --preconnect mode " << o.preconnect << "\n"; return 2; }
-            options.answer = Answer::Silent;
+            if (o.answer.empty()) options.answer = Answer::Silent;
+            if (!o.heldAnswer.empty()) {
+                options.heldAnswer = answerNamed(o.heldAnswer);
+                if (!options.heldAnswer) { std::cerr << "unknown --held-answer " << o.heldAnswer << "\n"; return 2; }
+            }
             options.preconnect = PreconnectReply{*mode, o.phone.openId, o.phone.id, ""};
         }
         listener = std::make_unique<Listener>(options, sayEvent);

@@ -233,6 +233,7 @@ struct Listener::Peer {
     FrameCutter cutter{1 << 20};
     bool requested = false;
     bool answered = false;
+    bool held = false;  // the PC's pre-connect request was answered on this link
 };
 
 Listener::Listener(Options options, std::function<void(const Event&)> onEvent)
@@ -369,6 +370,21 @@ bool Listener::pcClosed(std::chrono::milliseconds timeout) {
 }
 
 // False when the link is done (closed by the PC, or hung up by the phone).
+bool Listener::answerRequest(Peer& peer, Answer how, const Bytes& request) {
+    if (how == Answer::Silent) return true;
+    if (how == Answer::HangUp) {
+        report({Event::Kind::Closed, "", 0, false});
+        return false;
+    }
+    const int tag = options_.answerBody.empty() ? tagOf(how) : 0;
+    const Bytes answer = how == Answer::Echo              ? request
+                         : options_.answerBody.empty() ? buildPhoneFrameFromJson(nlohmann::json{{"bytes", {tag}}})
+                                                       : buildPhoneFrame(options_.answerBody);
+    peer.answered = writeAll(peer.fd, answer);
+    report({Event::Kind::Answered, "", tag, false});
+    return true;
+}
+
 bool Listener::onData(Peer& peer) {
     char buffer[16384];
     const ssize_t n = ::recv(peer.fd, buffer, sizeof buffer, 0);
@@ -387,21 +403,17 @@ bool Listener::onData(Peer& peer) {
                 return false;
             }
             answerPreconnect(peer);
+            peer.held = true;
             continue;
         }
-        if (options_.preconnect) continue;  // a pre-connected phone answers nothing else
-        if (peer.answered || options_.answer == Answer::Silent) continue;
-        if (options_.answer == Answer::HangUp) {
-            report({Event::Kind::Closed, "", 0, false});
-            return false;
+        if (peer.held) {
+            // On a held link only a connection request ([0]) is answered, each one.
+            if (phoneFrameTag(body) != 0 || !options_.heldAnswer) continue;
+            if (!answerRequest(peer, *options_.heldAnswer, *frame)) return false;
+            continue;
         }
-        const int tag = options_.answerBody.empty() ? tagOf(options_.answer) : 0;
-        const Bytes answer = options_.answer == Answer::Echo ? *frame
-                             : options_.answerBody.empty()
-                                 ? buildPhoneFrameFromJson(nlohmann::json{{"bytes", {tag}}})
-                                 : buildPhoneFrame(options_.answerBody);
-        peer.answered = writeAll(peer.fd, answer);
-        report({Event::Kind::Answered, "", tag, false});
+        if (peer.answered) continue;
+        if (!answerRequest(peer, options_.answer, *frame)) return false;
     }
     return true;
 }

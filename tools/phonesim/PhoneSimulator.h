@@ -124,7 +124,7 @@ nlohmann::json preconnectReplyBody(const PreconnectReply& reply);
 // A phone listening for PCs' connection requests; each link gets one answer (for its first
 // request) and is kept until the PC closes it. With `preconnect` set, a PC's pre-connect
 // request gets that reply instead, and the held link can be driven from the test (send,
-// flood, close).
+// flood, close); connection requests on it get `heldAnswer`.
 class Listener {
 public:
     struct Options {
@@ -134,6 +134,9 @@ public:
         std::string answerBody;          // when set, the body sent instead of {"bytes":[tag]}
         std::size_t maxLinks = 16;
         std::optional<PreconnectReply> preconnect;
+        // How a connection request ([0]) on a held pre-connected link is answered (each one);
+        // unset: not at all. A link without a pre-connect request gets `answer`.
+        std::optional<Answer> heldAnswer;
     };
     struct Event {
         enum class Kind { Accepted, Request, Answered, Closed } kind;
@@ -171,6 +174,8 @@ private:
     // Runs `command` on the serving thread and waits for it (bounded).
     bool run(Command command);
     void answerPreconnect(Peer& peer);
+    // Answers one connection request as `how` says; false when the link is to be closed.
+    bool answerRequest(Peer& peer, Answer how, const Bytes& request);
     void serve();
     void report(const Event& event);
     bool onData(Peer& peer);
