@@ -130,4 +130,52 @@ std::optional<std::vector<std::string>> LabTest::waitForLaunch(const std::string
     return args;
 }
 
+std::vector<nlohmann::json> receivedBodies(const ServiceProcess& sim) {
+    std::vector<nlohmann::json> bodies;
+    const std::string out = sim.output();
+    const std::string marker = "SIM TCP_REQUEST ";
+    for (auto at = out.find(marker); at != std::string::npos; at = out.find(marker, at + 1))
+        bodies.push_back(nlohmann::json::parse(lineAfter(out.substr(at), marker), nullptr, false));
+    return bodies;
+}
+
+void CloudLabTest::SetUp() {
+    LabTest::SetUp();
+    if (IsSkipped() || HasFatalFailure()) return;
+    pcsuite = startPcSuite();
+    ASSERT_TRUE(pcsuite);
+    pcsuite->setAnswer("/pcDeviceInfo", {200, R"({"code":"000000","data":{"deviceId":"PC-E2E","version":"1.0"}})"});
+    pcsuite->setAnswer("/connectDevice", {200, R"({"code":"000000","data":{"code":0,"reason":"connected"}})"});
+    center = startConnectCenter();
+    ASSERT_TRUE(center);
+}
+
+nlohmann::json CloudLabTest::listed(const NetNsLab::Node& node, const std::string& businessId,
+                                    const std::string& reportTime) {
+    using nlohmann::json;
+    return {{"userId", kOpenId},
+            {"name", "Sim " + businessId},
+            {"type", 1},
+            {"model", "SIM-1"},
+            {"reportTime", reportTime},
+            {"deviceId", "cloud-" + businessId},
+            {"bizInfo", {{"conn_base", {{"businessId", businessId}, {"cloudConnectionSupported", true}}}}},
+            {"inets", json::array({{{"inet", node.ip}, {"localInet", node.ip}, {"netmark", "255.255.255.0"},
+                                    {"ssid", "Home"}}})}};
+}
+
+void CloudLabTest::listPhones(const std::vector<nlohmann::json>& records) {
+    center->setAnswer("/device/list", {200, nlohmann::json{{"code", 0}, {"data", nlohmann::json(records)}}.dump()});
+}
+
+std::unique_ptr<ServiceProcess> CloudLabTest::phoneSim(const NetNsLab::Node& node, const std::string& businessId,
+                                                       const std::string& mode, std::vector<std::string> more) {
+    std::vector<std::string> args{"--tcp-port", "10191", "--preconnect", mode,         "--id",
+                                  businessId,   "--openid",  kOpenId,    "--duration", "90"};
+    args.insert(args.end(), more.begin(), more.end());
+    auto sim = startSimulator(node.ns, args);
+    EXPECT_TRUE(sim->waitForOutput("SIM READY", 5s)) << sim->output();
+    return sim;
+}
+
 }  // namespace kesu::test

@@ -63,4 +63,29 @@ protected:
     std::unique_ptr<StubPcSuite> recorder;  // in the PC node; receives the program launches
 };
 
+// The frame bodies a listening phone simulator received, in order (discarded JSON for a body
+// that is none).
+std::vector<nlohmann::json> receivedBodies(const ServiceProcess& sim);
+
+// The lab with the account's cloud: stand-ins for the PC suite (which names the PC "PC-E2E",
+// version "1.0") and for the connect center, whose device list names phones simulated in
+// their own nodes.
+class CloudLabTest : public LabTest {
+protected:
+    void SetUp() override;
+
+    // A phone of the account as the connect center lists it, reachable at the node's address.
+    static nlohmann::json listed(const NetNsLab::Node& node, const std::string& businessId,
+                                 const std::string& reportTime);
+    // The connect center's device list from now on.
+    void listPhones(const std::vector<nlohmann::json>& records);
+    // A phone of the account in `node` that answers the PC's pre-connect request as `mode` says
+    // (see phone_simulator --preconnect); `more` adds flags.
+    std::unique_ptr<ServiceProcess> phoneSim(const NetNsLab::Node& node, const std::string& businessId,
+                                             const std::string& mode, std::vector<std::string> more = {});
+
+    static inline const std::string kOpenId = "same-open";
+    std::unique_ptr<StubPcSuite> pcsuite, center;
+};
+
 }  // namespace kesu::test

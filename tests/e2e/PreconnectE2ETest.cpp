@@ -3,6 +3,7 @@
 // nodes, and the PC suite is a stand-in too. Needs root and `ip netns`.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <csignal>
 #include <nlohmann/json.hpp>
 
@@ -14,7 +15,6 @@ using nlohmann::json;
 
 namespace {
 
-const std::string kOpenId = "same-open";
 // The registry's key of a phone: the hex of the first four characters of its business id.
 const std::string kAnswering = "PHA1", kAnsweringKey = "50484131";
 const std::string kSilent = "SIL3", kSilentKey = "53494c33";
@@ -23,33 +23,10 @@ const std::string kSuccess = "[PreConnectionThread::run] preConnect result is su
 const std::string kFailed = "[PreConnectionThread::run] preConnect result is failed, id ";
 const std::string kAbnormal = "PreConnectionAbnormalNotify, connection appear abnormal id is: ";
 
-// A phone as the connect center lists it, reachable at the node's address.
-json listed(const NetNsLab::Node& node, const std::string& businessId, const std::string& reportTime) {
-    return {{"userId", kOpenId},
-            {"name", "Sim " + businessId},
-            {"type", 1},
-            {"model", "SIM-1"},
-            {"reportTime", reportTime},
-            {"deviceId", "cloud-" + businessId},
-            {"bizInfo", {{"conn_base", {{"businessId", businessId}, {"cloudConnectionSupported", true}}}}},
-            {"inets", json::array({{{"inet", node.ip}, {"localInet", node.ip}, {"netmark", "255.255.255.0"},
-                                    {"ssid", "Home"}}})}};
-}
-
 std::size_t count(const std::string& text, const std::string& what) {
     std::size_t n = 0;
     for (auto at = text.find(what); at != std::string::npos; at = text.find(what, at + what.size())) ++n;
     return n;
-}
-
-// The bodies the phone received, in order.
-std::vector<json> received(const ServiceProcess& sim) {
-    std::vector<json> bodies;
-    const std::string out = sim.output();
-    const std::string marker = "SIM TCP_REQUEST ";
-    for (auto at = out.find(marker); at != std::string::npos; at = out.find(marker, at + 1))
-        bodies.push_back(json::parse(lineAfter(out.substr(at), marker), nullptr, false));
-    return bodies;
 }
 
 // The entry of `key` in a preconnect_startScan answer (null when it is not listed).
@@ -60,40 +37,42 @@ json scanned(const json& scan, const std::string& key) {
     return nullptr;
 }
 
-class PreconnectE2E : public LabTest {
+class PreconnectE2E : public CloudLabTest {
 protected:
-    void SetUp() override {
-        LabTest::SetUp();
-        if (IsSkipped() || HasFatalFailure()) return;
-        pcsuite = startPcSuite();
-        ASSERT_TRUE(pcsuite);
-        pcsuite->setAnswer("/pcDeviceInfo", {200, R"({"code":"000000","data":{"deviceId":"PC-E2E","version":"1.0"}})"});
-        pcsuite->setAnswer("/connectDevice", {200, R"({"code":"000000","data":{"code":0,"reason":"connected"}})"});
-        center = startConnectCenter();
-        ASSERT_TRUE(center);
-    }
-
-    void listPhones(const std::vector<json>& records) {
-        center->setAnswer("/device/list", {200, json{{"code", 0}, {"data", json(records)}}.dump()});
-    }
-
-    // A phone that answers the PC's pre-connect request as `mode` says.
-    std::unique_ptr<ServiceProcess> phoneSim(const NetNsLab::Node& node, const std::string& id, const std::string& mode,
-                                             std::vector<std::string> more = {}) {
-        std::vector<std::string> args{"--tcp-port", "10191", "--preconnect", mode,    "--id",
-                                      id,           "--openid",  kOpenId,    "--duration", "90"};
-        args.insert(args.end(), more.begin(), more.end());
-        auto sim = startSimulator(node.ns, args);
-        EXPECT_TRUE(sim->waitForOutput("SIM READY", 5s)) << sim->output();
-        return sim;
-    }
-
-    std::unique_ptr<StubPcSuite> pcsuite, center;
+    // The center got this PC's report, sent before the device list was asked for.
+    void expectReportedBeforeList();
 };
 
-// Signing in fetches the account's list; its phone is pre-connected, the scan shows it held,
-// and when the phone asks to be connected it is acknowledged, the PC suite is asked to
-// connect it, and the outcome goes back to the phone.
+void PreconnectE2E::expectReportedBeforeList() {
+    const auto requests = center->requests();
+    const auto at = [&](const std::string& path) {
+        return std::find_if(requests.begin(), requests.end(), [&](const RecordedRequest& r) { return r.path == path; });
+    };
+    const auto report = at("/device/report");
+    ASSERT_NE(report, requests.end());
+    EXPECT_LT(report, at("/device/list"));
+    EXPECT_EQ(report->method, "POST");
+    const json body = json::parse(report->body, nullptr, false);
+    ASSERT_TRUE(body.is_array() && body.size() == 1 && body[0].is_object()) << report->body;
+    json pcReport = body[0];
+    EXPECT_EQ(pcReport["userId"], kOpenId);
+    EXPECT_EQ(pcReport["deviceId"], "PC-E2E");
+    EXPECT_EQ(pcReport["type"], 3);
+    EXPECT_EQ(pcReport["ext"], (json{{"pc_pcsuite_version", "1.0"}}));
+    // The phones find the PC by its business id and its addresses.
+    EXPECT_FALSE(pcReport.value("bluetooth", "").empty()) << pcReport;
+    EXPECT_EQ(pcReport["bizInfo"], (json{{"office_suite", {{"businessId", pcReport["bluetooth"]}}}}));
+    const json& inets = pcReport["inets"];
+    EXPECT_TRUE(inets.is_array() && std::any_of(inets.begin(), inets.end(), [&](const json& inet) {
+                    return inet.value("inet", "") == pc.ip && inet.value("localInet", "") == pc.ip &&
+                           inet.value("netmark", "") == "255.255.255.0";
+                }))
+        << pcReport;
+}
+
+// Signing in reports the PC to the connect center and fetches the account's list; its phone
+// is pre-connected, the scan shows it held, and when the phone asks to be connected it is
+// acknowledged, the PC suite is asked to connect it, and the outcome goes back to the phone.
 TEST_F(PreconnectE2E, SignInPreconnectsTheListedPhoneWhichThenAsksToBeConnected) {
     listPhones({listed(phone, kAnswering, "2026-12-06 10:00:00.000")});
     auto sim = phoneSim(phone, kAnswering, "answer", {"--ask-connect-after", "15"});
@@ -102,13 +81,14 @@ TEST_F(PreconnectE2E, SignInPreconnectsTheListedPhoneWhichThenAsksToBeConnected)
 
     const auto list = center->waitForRequest([](const RecordedRequest& r) { return r.path == "/device/list"; }, 15s);
     ASSERT_TRUE(list) << service->output();
+    expectReportedBeforeList();
     EXPECT_EQ(list->method, "GET");
     EXPECT_EQ(list->header("userId"), kOpenId);
     EXPECT_EQ(list->header("token"), "tok-e2e");
     EXPECT_EQ(list->header("deviceId"), "PC-E2E");
 
     ASSERT_TRUE(service->waitForOutput(kSuccess + kAnsweringKey, 10s)) << service->output() << sim->output();
-    const auto asked = received(*sim);
+    const auto asked = receivedBodies(*sim);
     ASSERT_FALSE(asked.empty());
     EXPECT_EQ(asked[0]["bytes"], json::array({22})) << asked[0];
     EXPECT_EQ(asked[0]["open_Id"], kOpenId);
@@ -128,13 +108,27 @@ TEST_F(PreconnectE2E, SignInPreconnectsTheListedPhoneWhichThenAsksToBeConnected)
         << connect->body;
 
     ASSERT_TRUE(sim->waitForOutput("\"bytes\":[27]", 10s)) << sim->output() << service->output();
-    const auto bodies = received(*sim);
+    const auto bodies = receivedBodies(*sim);
     ASSERT_EQ(bodies.size(), 3u) << sim->output();
     EXPECT_EQ(bodies[1]["bytes"], json::array({25})) << bodies[1];
     EXPECT_EQ(bodies[2]["bytes"], json::array({27})) << bodies[2];
     EXPECT_EQ(json::parse(bodies[2].value("extra_info", ""), nullptr, false),
               (json{{"retCode", 0}, {"retMsg", "connected"}}))
         << bodies[2];
+}
+
+// The PC suite signs in through the control API: the PC is reported, then the list is
+// fetched with the account it gave.
+TEST_F(PreconnectE2E, AccountChangeRequestReportsThePcAndFetchesTheList) {
+    listPhones({});
+    auto service = startService();
+    EXPECT_EQ(control(pc.ns, "accountChange", {kOpenId, "tok-ac", "13912345678", home + "/store"}),
+              (json{{"error", 0}, {"error_message", "accountChange request success"}}));
+    const auto list = center->waitForRequest([](const RecordedRequest& r) { return r.path == "/device/list"; }, 10s);
+    ASSERT_TRUE(list) << service->output();
+    EXPECT_EQ(list->header("userId"), kOpenId);
+    EXPECT_EQ(list->header("token"), "tok-ac");
+    expectReportedBeforeList();
 }
 
 // A service that starts signed in (after a reboot, say) fetches the list and pre-connects
