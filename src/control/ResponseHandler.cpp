@@ -103,11 +103,15 @@ std::string primaryBusyReply() {
     return ResponseHandler::response(error, "PC_STATE_BUSY");
 }
 
-// The connection over a pre-connection, with the busy slot held for its whole length.
+// The connection over a pre-connection, with the busy slot held for its whole length. The
+// third parameter says whether the PC suite connects on its own ("isAutoConnect" to the
+// phone); the type of the device being connected is known to a busy answer as soon as the
+// flow has found the device.
 std::string connectPreconnected(const Json& params, const std::string& id) {
-    std::string deviceType = params.size() >= 3 ? paramText(params, 2) : std::string();
-    std::string autoConnectType = ConnectionState::getPrimaryConnectDeviceType();
-    const std::string result = ConnectFlow().start(id, deviceType, autoConnectType);
+    const std::string autoConnectType = params.size() >= 3 ? paramText(params, 2) : std::string();
+    std::string deviceType = ConnectionState::getPrimaryConnectDeviceType();
+    ConnectFlow flow([](const std::string& type) { ConnectionState::setPrimaryConnectDeviceType(type); });
+    const std::string result = flow.start(id, deviceType, autoConnectType);
     ReportDevicesV2::instance().notify();
     ConnectionState::setIsCanPrimaryConnectDevice(true);
     return result;
