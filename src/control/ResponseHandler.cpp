@@ -14,6 +14,7 @@
 #include "core/Log.h"
 #include "core/Text.h"
 #include "pcsuite/PcsuiteClient.h"
+#include "pcsuite/RequestBase.h"
 #include "platform/SystemInfo.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/StateCheck.h"
@@ -364,7 +365,7 @@ std::string ResponseHandler::create(const requestObj& request) {
             return connectCenterEvent(request, true);
         case RequestEvent::kpush:
             Log::mPrintlog("kpush Request ...");
-            Log::mPrintlog("kpush data is " + json::compact(request.params));
+            Log::mPrintlog("kpush data is " + RequestBase::maskForLog(json::compact(request.params)));
             return KPushReceiveEventHandler::instance().kpushInfoHandler(request.params);
         case RequestEvent::enable:
             Log::mPrintlog("enable request, open wifi switch ... \n");

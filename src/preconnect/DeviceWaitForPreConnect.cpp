@@ -449,10 +449,8 @@ asio::awaitable<void> DeviceWaitForPreConnect::mobileAskConnectPC(std::string da
     const std::optional<Json> reply = co_await loop_.runBlocking(std::move(ask));
     Json result = Json::object();
     if (reply) {
-        const Json answer = json::object(*reply, "data");
-        if (answer.contains("code") && answer["code"].is_number_integer() && answer.contains("reason") &&
-            answer["reason"].is_string())
-            result = {{"retCode", answer["code"]}, {"retMsg", answer["reason"]}};
+        if (const auto outcome = PcsuiteRequest::connectDeviceOutcome(*reply))
+            result = {{"retCode", outcome->code}, {"retMsg", outcome->reason}};
     } else {
         Log::mPrintlog("[DeviceWaitForPreConnect::mobileAskConnectPC] connect device failed \n");
     }
