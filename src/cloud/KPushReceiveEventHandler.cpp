@@ -100,12 +100,9 @@ std::string KPushReceiveEventHandler::kpushInfoHandler(const Json& params) {
 
     if (cmd == "MQTT_CONNECT_SERVER_SUCCESS" || cmd == "QUERY_CLIENT_ID") {
         if (exdata) {
-            // A message without a usable id leaves the known one in place: the connect center
-            // reaches this PC only through it.
-            if (const auto clientId = stringMember(kHandlerTag, *exdata, "clientId")) {
-                dataInstance().set(&databaseParam::clientId, *clientId);
-                Log::mPrintlog(kHandlerTag + "clientId: " + *clientId);
-            }
+            const std::string clientId = stringMember(kHandlerTag, *exdata, "clientId").value_or("");
+            dataInstance().set(&databaseParam::clientId, clientId);
+            Log::mPrintlog(kHandlerTag + "clientId: " + clientId);
         }
     } else if (cmd == "MQTT_SUBSCRIBE_MSG_ARRIVED") {
         if (exdata) {
