@@ -15,11 +15,13 @@ using nlohmann::json;
 namespace {
 
 const std::string kSuccess = "[PreConnectionThread::run] preConnect result is success, id ";
+const std::string kAbnormal = "PreConnectionAbnormalNotify, connection appear abnormal id is: ";
 // Business ids and the registry keys made of them (the hex of the first four characters).
 const std::string kAccepting = "ACC1", kAcceptingKey = "41434331";
 const std::string kRejecting = "REJ2", kRejectingKey = "52454a32";
 const std::string kBusy = "BSY3", kBusyKey = "42535933";
 const std::string kSilent = "SIL4", kSilentKey = "53494c34";
+const std::string kGone = "GON6", kGoneKey = "474f4e36";
 const std::string kPushed = "PSH5";
 
 json reply(int error, const std::string& message, const std::string& data, const std::string& steps) {
@@ -45,13 +47,15 @@ class ConnectFlowE2E : public CloudLabTest {};
 
 // One held phone per answer, one service: the request travels over the held link and the
 // phone's answer there makes the reply; a phone silent on its link is connected afresh; an id
-// that is not held is not found.
+// that is not listed, or listed but not held, is not found.
 TEST_F(ConnectFlowE2E, HeldPhonesAnswerOverTheirLinkOrAFreshOne) {
     const auto rejecting = addPhone("phone2", 3);
     const auto busy = addPhone("phone3", 4);
     const auto silent = addPhone("phone4", 5);
     listPhones({listed(phone, kAccepting, "2026-12-06 10:00:00.000"), listed(rejecting, kRejecting, "2026-12-06 10:00:01.000"),
-                listed(busy, kBusy, "2026-12-06 10:00:02.000"), listed(silent, kSilent, "2026-12-06 10:00:03.000")});
+                listed(busy, kBusy, "2026-12-06 10:00:02.000"), listed(silent, kSilent, "2026-12-06 10:00:03.000"),
+                // Nobody at that address; reported first, so it is tried last.
+                listed({"", "", "10.77.0.9"}, kGone, "2026-12-06 09:00:00.000")});
     auto accepts = phoneSim(phone, kAccepting, "answer", {"--held-answer", "accept"});
     auto rejects = phoneSim(rejecting, kRejecting, "answer", {"--held-answer", "reject"});
     auto busies = phoneSim(busy, kBusy, "answer", {"--held-answer", "busy"});
@@ -61,8 +65,10 @@ TEST_F(ConnectFlowE2E, HeldPhonesAnswerOverTheirLinkOrAFreshOne) {
     for (const std::string& key : {kAcceptingKey, kRejectingKey, kBusyKey, kSilentKey})
         ASSERT_TRUE(service->waitForOutput(kSuccess + key, 20s)) << key << "\n" << service->output();
 
-    EXPECT_EQ(control(pc.ns, "preconnect_connect", {"00000000", "", "1"}),
-              reply(-10002, "Preconnect device not find", "", "_WFD:-1"));
+    for (const std::string& key : {std::string("00000000"), kGoneKey})
+        EXPECT_EQ(control(pc.ns, "preconnect_connect", {key, "", "1"}),
+                  reply(-10002, "Preconnect device not find", "", "_WFD:-1"))
+            << key;
 
     EXPECT_EQ(control(pc.ns, "preconnect_connect", {kAcceptingKey, "", "1"}),
               reply(0, "", phone.ip, "_WFD:0_WSR:0_WRR:0_WPR:0"))
@@ -92,6 +98,8 @@ TEST_F(ConnectFlowE2E, HeldPhonesAnswerOverTheirLinkOrAFreshOne) {
     EXPECT_TRUE(tries[0].contains("extra_info")) << tries[0];
     EXPECT_FALSE(tries[1].contains("extra_info")) << tries[1];
     EXPECT_GE(linksAccepted(*falls), 2u) << falls->output();
+    // The link that failed to answer is given up.
+    EXPECT_TRUE(service->waitForOutput(kAbnormal + kSilentKey, 5s)) << service->output();
 }
 
 // A phone asks through the cloud to be pre-connected: the push message makes the service
