@@ -73,6 +73,8 @@ TEST_F(ConnectFlowE2E, HeldPhonesAnswerOverTheirLinkOrAFreshOne) {
     EXPECT_EQ(control(pc.ns, "preconnect_connect", {kAcceptingKey, "", "1"}),
               reply(0, "", phone.ip, "_WFD:0_WSR:0_WRR:0_WPR:0"))
         << service->output();
+    // The phone printed its request before it answered; the output may just be on its way.
+    ASSERT_TRUE(accepts->waitForOutput("SIM TCP_ANSWERED 1", 2s)) << accepts->output();
     const auto requests = connectRequests(*accepts);
     ASSERT_EQ(requests.size(), 1u) << accepts->output();
     json request = requests[0];
@@ -93,6 +95,7 @@ TEST_F(ConnectFlowE2E, HeldPhonesAnswerOverTheirLinkOrAFreshOne) {
     EXPECT_EQ(control(pc.ns, "preconnect_connect", {kSilentKey, "", "0"}),
               reply(0, "", silent.ip, "_WFD:0_WSR:0_WRR:-1_TF:0_WO:0"))
         << service->output() << falls->output();
+    ASSERT_TRUE(falls->waitForOutput("SIM TCP_ANSWERED 1", 2s)) << falls->output();
     const auto tries = connectRequests(*falls);
     ASSERT_EQ(tries.size(), 2u) << falls->output();
     EXPECT_TRUE(tries[0].contains("extra_info")) << tries[0];
