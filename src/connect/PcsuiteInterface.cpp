@@ -2,7 +2,9 @@
 
 #include <asio/co_spawn.hpp>
 
+#include <condition_variable>
 #include <future>
+#include <utility>
 
 #include "core/ConnectCodes.h"
 #include "connect/ConnectMessage.h"
@@ -47,11 +49,45 @@ namespace {
 
 std::atomic<EventLoop*> attemptLoop{nullptr};
 
-// Held for the whole of one attempt (and of a fallback's fresh link, which shares the port).
-std::timed_mutex& attemptMutex() {
-    static auto* mutex = new std::timed_mutex();
-    return *mutex;
+// Taken for the whole of one attempt (and of a fallback's fresh link, which shares the
+// port): a PC-initiated connection does not wait for it, a fallback waits within its deadline.
+// (A condition variable rather than a timed mutex, whose timed lock the thread checker
+// cannot follow.)
+class AttemptSlot {
+public:
+    bool tryTake() {
+        std::lock_guard<std::mutex> lock(mutex_);
+        return std::exchange(taken_, true) == false;
+    }
+    bool takeBefore(std::chrono::steady_clock::time_point deadline) {
+        std::unique_lock<std::mutex> lock(mutex_);
+        if (!freed_.wait_until(lock, deadline, [this] { return !taken_; })) return false;
+        taken_ = true;
+        return true;
+    }
+    void give() {
+        {
+            std::lock_guard<std::mutex> lock(mutex_);
+            taken_ = false;
+        }
+        freed_.notify_one();
+    }
+
+private:
+    std::mutex mutex_;
+    std::condition_variable freed_;
+    bool taken_ = false;
+};
+
+AttemptSlot& attemptSlot() {
+    static auto* slot = new AttemptSlot();
+    return *slot;
 }
+
+// Gives the slot back when the attempt that took it returns.
+struct SlotHeld {
+    ~SlotHeld() { attemptSlot().give(); }
+};
 
 // Runs the exchange of `work` with ip's phone on `loop` and waits for its outcome on the
 // calling thread. The deadline bounds the exchange itself, the margin only a loop that ends
@@ -90,11 +126,11 @@ std::string busyReply() {
 void PcsuiteInterface::setLoop(EventLoop* loop) { attemptLoop.store(loop); }
 
 std::string PcsuiteInterface::ActiveConnect(const std::string& stringId) {
-    std::unique_lock<std::timed_mutex> oneAttempt(attemptMutex(), std::try_to_lock);
-    if (!oneAttempt.owns_lock()) {
+    if (!attemptSlot().tryTake()) {
         Log::mPrintlog("[ActiveConnect] another connection is in progress, " + stringId + " is answered busy \n");
         return busyReply();
     }
+    SlotHeld oneAttempt;
 
     const Step& step = sharedStep();
     const Config& config = Config::current();
@@ -214,11 +250,11 @@ PcsuiteInterface::FreshRequest PcsuiteInterface::requestOnFreshLink(const std::s
                                                                     SocketClient::Clock::time_point deadline,
                                                                     std::function<bool()> stopRequested) {
     FreshRequest request;
-    std::unique_lock<std::timed_mutex> oneAttempt(attemptMutex(), std::defer_lock);
-    if (!oneAttempt.try_lock_until(deadline)) {
+    if (!attemptSlot().takeBefore(deadline)) {
         Log::mPrintlog("[PcsuiteInterface::requestOnFreshLink] another connection kept the phone port until the deadline \n");
         return request;
     }
+    SlotHeld oneAttempt;
     EventLoop* const loop = attemptLoop.load();
     if (loop == nullptr || !loop->running() || ip.empty()) return request;
     const auto work = std::make_shared<ClientWorkAct>(std::make_shared<SocketClient>(loop->executor()));
