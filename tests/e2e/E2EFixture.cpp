@@ -178,4 +178,13 @@ std::unique_ptr<ServiceProcess> CloudLabTest::phoneSim(const NetNsLab::Node& nod
     return sim;
 }
 
+std::unique_ptr<ServiceProcess> CloudLabTest::startServiceGivenUpOn(const NetNsLab::Node& node,
+                                                                    const std::string& businessId) {
+    listPhones({listed(node, businessId, "2026-12-06 10:00:00.000")});
+    auto service = startService();
+    writeAccount(kOpenId, "13912345678");
+    EXPECT_TRUE(service->waitForOutput("add FARAWAYWLAN connect count, current count is: 2", 20s)) << service->output();
+    return service;
+}
+
 }  // namespace kesu::test

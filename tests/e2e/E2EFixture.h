@@ -83,6 +83,9 @@ protected:
     // (see phone_simulator --preconnect); `more` adds flags.
     std::unique_ptr<ServiceProcess> phoneSim(const NetNsLab::Node& node, const std::string& businessId,
                                              const std::string& mode, std::vector<std::string> more = {});
+    // The service, signed in, with the phone `businessId` of `node` listed and given up on by
+    // the scheduler: nothing listened there for both of its tries.
+    std::unique_ptr<ServiceProcess> startServiceGivenUpOn(const NetNsLab::Node& node, const std::string& businessId);
 
     static inline const std::string kOpenId = "same-open";
     std::unique_ptr<StubPcSuite> pcsuite, center;

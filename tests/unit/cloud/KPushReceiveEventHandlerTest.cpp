@@ -148,28 +148,16 @@ TEST_F(KPushTest, MalformedMessagesAreTakenAsAbsentAndAnsweredCleanly) {
 }
 
 // A phone that really pre-connects: the notice waits for the handshake and reports success.
-class KPushPreconnectTest : public test::PreconnectTest {
+class KPushPreconnectTest : public test::SchedulingTest {
 protected:
     void SetUp() override {
-        PreconnectTest::SetUp();
-        StrategyDevicePreconnect::clearUserPicks();
-        env.config().preconnectPeriod = 20ms;
-        env.config().telemetryUdpPort = test::freeUdpPort();
+        SchedulingTest::SetUp();
         dataInstance().set(&databaseParam::pcDeviceId, "pc-1");
         center.setDefaultAnswer({200, R"({"code":0})"});
         Endpoints::setConnectCenterServerUrl(center.baseUrl());
-        DeviceWaitForPreConnectManager::instance().setEventLoop(&loop);
-    }
-    void TearDown() override {
-        scheduler.stop();
-        DeviceWaitForPreConnectManager::instance().clearAllDevices();
-        DeviceWaitForPreConnectManager::instance().setEventLoop(nullptr);
-        StrategyDevicePreconnect::clearUserPicks();
-        PreconnectTest::TearDown();
     }
 
     test::StubPcSuite center;
-    PreConnectionThread scheduler{loop};
 };
 
 TEST_F(KPushPreconnectTest, PreConnectOfAKnownPhoneReportsSuccess) {

@@ -13,21 +13,11 @@ namespace {
 
 using namespace std::chrono_literals;
 
-class SchedulerTest : public test::PreconnectTest {
+class SchedulerTest : public test::SchedulingTest {
 protected:
     void SetUp() override {
-        PreconnectTest::SetUp();
-        StrategyDevicePreconnect::clearUserPicks();
-        env.config().preconnectPeriod = 20ms;
+        SchedulingTest::SetUp();
         env.config().telemetryUdpPort = collector.port();
-        DeviceWaitForPreConnectManager::instance().setEventLoop(&loop);
-    }
-    void TearDown() override {
-        scheduler.stop();
-        DeviceWaitForPreConnectManager::instance().clearAllDevices();
-        DeviceWaitForPreConnectManager::instance().setEventLoop(nullptr);
-        StrategyDevicePreconnect::clearUserPicks();
-        PreconnectTest::TearDown();
     }
 
     // An entry in `registry` whose device reported at `reportTime`.
@@ -63,7 +53,6 @@ protected:
     }
 
     test::UdpCatcher collector;
-    PreConnectionThread scheduler{loop};
 };
 
 TEST_F(SchedulerTest, StrategyChoosesPicksThenNeverFailedThenOnceFailed) {

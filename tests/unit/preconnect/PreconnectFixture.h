@@ -20,7 +20,10 @@
 #include "phonesim/PhoneSimulator.h"
 #include "preconnect/DeviceWaitForPreConnect.h"
 #include "preconnect/PreConnectionStatus.h"
+#include "preconnect/PreConnectionThread.h"
+#include "preconnect/StrategyDevicePreconnect.h"
 #include "support/StubPcSuite.h"
+#include "unit/UnitHelpers.h"
 
 namespace kesu::test {
 
@@ -134,6 +137,28 @@ protected:
 
     StubPcSuite pcsuite;
     std::shared_ptr<NoticeRecorder> notices = std::make_shared<NoticeRecorder>();
+};
+
+// The service's registry with the scheduler running on the loop: what a user's pick or a
+// pushed request waits for.
+class SchedulingTest : public PreconnectTest {
+protected:
+    void SetUp() override {
+        PreconnectTest::SetUp();
+        StrategyDevicePreconnect::clearUserPicks();
+        env.config().preconnectPeriod = 20ms;
+        env.config().telemetryUdpPort = freeUdpPort();
+        DeviceWaitForPreConnectManager::instance().setEventLoop(&loop);
+    }
+    void TearDown() override {
+        scheduler.stop();
+        DeviceWaitForPreConnectManager::instance().clearAllDevices();
+        DeviceWaitForPreConnectManager::instance().setEventLoop(nullptr);
+        StrategyDevicePreconnect::clearUserPicks();
+        PreconnectTest::TearDown();
+    }
+
+    PreConnectionThread scheduler{loop};
 };
 
 }  // namespace kesu::test
