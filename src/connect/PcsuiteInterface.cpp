@@ -47,10 +47,33 @@ namespace {
 
 std::atomic<EventLoop*> attemptLoop{nullptr};
 
-// Held for the whole of one attempt.
-std::mutex& attemptMutex() {
-    static auto* mutex = new std::mutex();
+// Held for the whole of one attempt (and of a fallback's fresh link, which shares the port).
+std::timed_mutex& attemptMutex() {
+    static auto* mutex = new std::timed_mutex();
     return *mutex;
+}
+
+// Runs the exchange of `work` with ip's phone on `loop` and waits for its outcome on the
+// calling thread. The deadline bounds the exchange itself, the margin only a loop that ends
+// meanwhile.
+ClientWorkAct::Outcome runExchange(EventLoop& loop, const std::shared_ptr<ClientWorkAct>& work, const std::string& ip,
+                                   SocketClient::Clock::time_point deadline, std::function<bool()> stopRequested) {
+    // Shared with the exchange on the loop, which may outlive this call when the loop stalls.
+    auto result = std::make_shared<std::promise<ClientWorkAct::Outcome>>();
+    auto future = result->get_future();
+    asio::co_spawn(loop.executor(),
+                   work->ClientReqServer(static_cast<std::uint16_t>(Config::current().phoneTcpPort), ip, deadline,
+                                         std::move(stopRequested)),
+                   [result, work](std::exception_ptr failure, ClientWorkAct::Outcome outcome) {
+                       if (failure) outcome = ClientWorkAct::Outcome::NoAnswer;
+                       result->set_value(outcome);
+                   });
+    try {
+        if (future.wait_until(deadline + std::chrono::seconds(5)) == std::future_status::ready) return future.get();
+    } catch (const std::future_error&) {
+        // The loop ended with the exchange unfinished.
+    }
+    return ClientWorkAct::Outcome::Stopped;
 }
 
 std::string busyReply() {
@@ -67,7 +90,7 @@ std::string busyReply() {
 void PcsuiteInterface::setLoop(EventLoop* loop) { attemptLoop.store(loop); }
 
 std::string PcsuiteInterface::ActiveConnect(const std::string& stringId) {
-    std::unique_lock<std::mutex> oneAttempt(attemptMutex(), std::try_to_lock);
+    std::unique_lock<std::timed_mutex> oneAttempt(attemptMutex(), std::try_to_lock);
     if (!oneAttempt.owns_lock()) {
         Log::mPrintlog("[ActiveConnect] another connection is in progress, " + stringId + " is answered busy \n");
         return busyReply();
@@ -117,7 +140,6 @@ std::string PcsuiteInterface::ActiveConnect(const std::string& stringId) {
         return finish(rawValue(ErrorCode::TIMEOUT), "error_message",
                       "[SSDP search] connect timeout or phone wake up pcsuite failed.");
     }
-    // Shared with the exchange on the loop, which may outlive this call when the loop stalls.
     const auto work = std::make_shared<ClientWorkAct>(std::make_shared<SocketClient>(loop->executor()));
     AttachGuard attached;
     if (SSDPcancel().attach(work->ClientShared, *loop)) {
@@ -129,24 +151,7 @@ std::string PcsuiteInterface::ActiveConnect(const std::string& stringId) {
 
     const std::string& ip = device->ip.front();
     Log::mPrintlog("[ActiveConnect] Enter the accept event waiting! \n");
-    // The exchange runs on the loop; this (control API) thread waits for its outcome. The
-    // deadline bounds the exchange itself, the margin only a loop that ends meanwhile.
-    auto result = std::make_shared<std::promise<ClientWorkAct::Outcome>>();
-    auto future = result->get_future();
-    asio::co_spawn(
-        loop->executor(),
-        work->ClientReqServer(static_cast<std::uint16_t>(config.phoneTcpPort), ip, deadline,
-                              [] { return SSDPcancel().load(); }),
-        [result, work](std::exception_ptr failure, ClientWorkAct::Outcome outcome) {
-            if (failure) outcome = ClientWorkAct::Outcome::NoAnswer;
-            result->set_value(outcome);
-        });
-    auto outcome = ClientWorkAct::Outcome::Stopped;
-    try {
-        if (future.wait_until(deadline + std::chrono::seconds(5)) == std::future_status::ready) outcome = future.get();
-    } catch (const std::future_error&) {
-        // The loop ended with the exchange unfinished.
-    }
+    const auto outcome = runExchange(*loop, work, ip, deadline, [] { return SSDPcancel().load(); });
     const auto disconnect = [&] { loop->call([work] { work->ClientDisConnServer(); }); };
     const bool cancelled = SSDPcancel().load();
     Log::mPrintlog(outcome == ClientWorkAct::Outcome::Answered || cancelled
@@ -203,6 +208,24 @@ std::string PcsuiteInterface::ActiveConnect(const std::string& stringId) {
         return finish(rawValue(ErrorCode::TIMEOUT), "error_message",
                       "[SSDP search] connect timeout or phone wake up pcsuite failed.");
     }
+}
+
+PcsuiteInterface::FreshRequest PcsuiteInterface::requestOnFreshLink(const std::string& ip,
+                                                                    SocketClient::Clock::time_point deadline,
+                                                                    std::function<bool()> stopRequested) {
+    FreshRequest request;
+    std::unique_lock<std::timed_mutex> oneAttempt(attemptMutex(), std::defer_lock);
+    if (!oneAttempt.try_lock_until(deadline)) {
+        Log::mPrintlog("[PcsuiteInterface::requestOnFreshLink] another connection kept the phone port until the deadline \n");
+        return request;
+    }
+    EventLoop* const loop = attemptLoop.load();
+    if (loop == nullptr || !loop->running() || ip.empty()) return request;
+    const auto work = std::make_shared<ClientWorkAct>(std::make_shared<SocketClient>(loop->executor()));
+    request.outcome = runExchange(*loop, work, ip, deadline, std::move(stopRequested));
+    request.answer = work->ClientShared->ServerMessageReceive();
+    loop->call([work] { work->ClientDisConnServer(); });
+    return request;
 }
 
 }  // namespace kesu

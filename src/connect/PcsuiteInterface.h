@@ -2,14 +2,16 @@
 #pragma once
 
 #include <atomic>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
 
+#include "connect/SocketClient.h"
+
 namespace kesu {
 
 class EventLoop;
-class SocketClient;
 
 // The cancel request of the running PC-initiated connection. Setting it to true also ends
 // the running attempt's wait at once (its link is shut); the attempt then answers as
@@ -46,6 +48,17 @@ public:
     // attempt failed or was cancelled, or Config::activeConnectTimeout passed. One attempt
     // runs at a time: a call while another runs gets the busy reply.
     std::string ActiveConnect(const std::string& stringId);
+
+    struct FreshRequest {
+        ClientWorkAct::Outcome outcome = ClientWorkAct::Outcome::ConnectFailed;
+        std::string answer;  // the text of the phone's answer, "" when none
+    };
+    // One connection request on a fresh link to ip's phone port, the exchange on the loop,
+    // the calling thread (never the loop's) waiting until it ended or `deadline` passed.
+    // A running PC-initiated connection is waited for first, within the same deadline: the
+    // two must not overlap. `stopRequested` is asked after the connect and after the send.
+    static FreshRequest requestOnFreshLink(const std::string& ip, SocketClient::Clock::time_point deadline,
+                                           std::function<bool()> stopRequested = {});
 };
 
 }  // namespace kesu

@@ -14,6 +14,7 @@
 #include "core/Log.h"
 #include "core/Text.h"
 #include "pcsuite/PcsuiteClient.h"
+#include "pcsuite/RequestBase.h"
 #include "platform/SystemInfo.h"
 #include "discovery/SsdpDeviceManager.h"
 #include "discovery/StateCheck.h"
@@ -103,11 +104,15 @@ std::string primaryBusyReply() {
     return ResponseHandler::response(error, "PC_STATE_BUSY");
 }
 
-// The connection over a pre-connection, with the busy slot held for its whole length.
+// The connection over a pre-connection, with the busy slot held for its whole length. The
+// third parameter says whether the PC suite connects on its own ("isAutoConnect" to the
+// phone); the type of the device being connected is known to a busy answer as soon as the
+// flow has found the device.
 std::string connectPreconnected(const Json& params, const std::string& id) {
-    std::string deviceType = params.size() >= 3 ? paramText(params, 2) : std::string();
-    std::string autoConnectType = ConnectionState::getPrimaryConnectDeviceType();
-    const std::string result = ConnectFlow().start(id, deviceType, autoConnectType);
+    const std::string autoConnectType = params.size() >= 3 ? paramText(params, 2) : std::string();
+    std::string deviceType = ConnectionState::getPrimaryConnectDeviceType();
+    ConnectFlow flow([](const std::string& type) { ConnectionState::setPrimaryConnectDeviceType(type); });
+    const std::string result = flow.start(id, deviceType, autoConnectType);
     ReportDevicesV2::instance().notify();
     ConnectionState::setIsCanPrimaryConnectDevice(true);
     return result;
@@ -360,7 +365,7 @@ std::string ResponseHandler::create(const requestObj& request) {
             return connectCenterEvent(request, true);
         case RequestEvent::kpush:
             Log::mPrintlog("kpush Request ...");
-            Log::mPrintlog("kpush data is " + json::compact(request.params));
+            Log::mPrintlog("kpush data is " + RequestBase::maskForLog(json::compact(request.params)));
             return KPushReceiveEventHandler::instance().kpushInfoHandler(request.params);
         case RequestEvent::enable:
             Log::mPrintlog("enable request, open wifi switch ... \n");

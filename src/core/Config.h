@@ -75,6 +75,11 @@ struct Config {
     // The scheduler tries one device per period; a user's request to pre-connect one device
     // waits for the outcome up to preconnectUserWait.
     std::chrono::milliseconds preconnectPeriod{1000};
+    // A connection over a held link: the request's send and the phone's answer get their own
+    // window each, the fallback on a fresh link its own.
+    std::chrono::milliseconds connectFlowSendTimeout{3000};
+    std::chrono::milliseconds connectFlowAnswerTimeout{3000};
+    std::chrono::milliseconds connectFlowFallbackTimeout{5000};
     std::chrono::milliseconds preconnectUserWait{60000};
     std::chrono::milliseconds preconnectConnectTimeout{3000};
     std::chrono::milliseconds preconnectHandshakeTimeout{3000};

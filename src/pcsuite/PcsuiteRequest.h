@@ -17,6 +17,13 @@ std::string rawValue(PCSUITE_HTTP_PATH path);  // "pcDeviceInfo", "connectDevice
 enum class PcsuiteResCode { Success };
 std::string rawValue(PcsuiteResCode code);  // "000000"
 
+// What the PC suite made of a request to connect a pre-connected device: "data"."code" (0 is
+// success) and "data"."reason".
+struct ConnectDeviceOutcome {
+    long long code = 0;
+    std::string reason;
+};
+
 class PcsuiteRequest {
 public:
     // Sends `body` (compact JSON, or nothing) to the PC suite's `path` and returns the answer
@@ -30,6 +37,9 @@ public:
     static std::optional<Json> getPcDeviceInfo();
     // Asks the PC suite to start the user-visible connection to a pre-connected device.
     static std::optional<Json> startConnectPreDevice(const std::map<std::string, std::string>& data);
+    // The outcome carried by an accepted startConnectPreDevice answer; none unless "data" has
+    // an integer "code" and a text "reason".
+    static std::optional<ConnectDeviceOutcome> connectDeviceOutcome(const Json& answer);
 };
 
 }  // namespace kesu

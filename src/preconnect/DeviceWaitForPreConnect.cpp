@@ -117,7 +117,14 @@ void DeviceWaitForPreConnect::updateFarawayDeviceInfo(const FarawayDevice& faraw
     if (auto device = getFarawayDevice()) device->updateFrom(farawayDevice);
 }
 
-void DeviceWaitForPreConnect::setIsConnected(bool value) { isConnected_ = value; }
+void DeviceWaitForPreConnect::setIsConnected(bool value) {
+    isConnected_ = value;
+    if (value) return;
+    // A waiter for the phone's answer checks the flag under the lock: take it once so that
+    // the waiter either saw the flag or is waiting when the notice comes.
+    { std::lock_guard<std::mutex> lock(messageLock_); }
+    messageArrived_.notify_all();
+}
 
 void DeviceWaitForPreConnect::addConnectCount() {
     if (getConnectType() != kWlan) return;
@@ -321,6 +328,10 @@ asio::awaitable<bool> DeviceWaitForPreConnect::startPreConnect() {
     const auto link = device->getCommunicationChannel();
     if (!link || link->isShut()) co_return false;
     auto held = std::make_shared<HeldLink>(link, executor);
+    {
+        std::lock_guard<std::mutex> lock(messageLock_);
+        heldLinkEnded_ = false;
+    }
     asio::co_spawn(executor, recvMessageAndHeartbeatLoop(device->getClientId(), held), asio::detached);
     asio::co_spawn(executor, consumeMessageLoop(held), asio::detached);
     co_return true;
@@ -384,6 +395,11 @@ asio::awaitable<void> DeviceWaitForPreConnect::recvMessageAndHeartbeatLoop(int c
     held->ended = true;
     held->wake.cancel();
     held->link->shut();
+    {
+        std::lock_guard<std::mutex> lock(messageLock_);
+        heldLinkEnded_ = true;
+    }
+    messageArrived_.notify_all();
 
     const auto device = getFarawayDevice();
     const std::string deviceId = device ? device->getDeviceId() : std::string();
@@ -433,10 +449,8 @@ asio::awaitable<void> DeviceWaitForPreConnect::mobileAskConnectPC(std::string da
     const std::optional<Json> reply = co_await loop_.runBlocking(std::move(ask));
     Json result = Json::object();
     if (reply) {
-        const Json answer = json::object(*reply, "data");
-        if (answer.contains("code") && answer["code"].is_number_integer() && answer.contains("reason") &&
-            answer["reason"].is_string())
-            result = {{"retCode", answer["code"]}, {"retMsg", answer["reason"]}};
+        if (const auto outcome = PcsuiteRequest::connectDeviceOutcome(*reply))
+            result = {{"retCode", outcome->code}, {"retMsg", outcome->reason}};
     } else {
         Log::mPrintlog("[DeviceWaitForPreConnect::mobileAskConnectPC] connect device failed \n");
     }
@@ -464,11 +478,11 @@ void DeviceWaitForPreConnect::queueMessage(Bytes frame) {
     if (dropped > 0)
         Log::mPrintlog("[DeviceWaitForPreConnect::queueMessage] id " + id_ + " message queue full, dropped the " +
                          std::to_string(dropped) + " oldest frame(s)");
+    messageArrived_.notify_all();
 }
 
-bool DeviceWaitForPreConnect::getQueueMessage(Bytes& data) {
+bool DeviceWaitForPreConnect::takeOldestLocked(Bytes& data) {
     const auto oldest = std::chrono::steady_clock::now() - Config::current().preconnectQueueMaxAge;
-    std::lock_guard<std::mutex> lock(messageLock_);
     while (!messageQueue_.empty() && messageQueue_.front().at < oldest) {
         queuedBytes_ -= messageQueue_.front().frame.size();
         messageQueue_.pop_front();
@@ -478,6 +492,20 @@ bool DeviceWaitForPreConnect::getQueueMessage(Bytes& data) {
     data = std::move(messageQueue_.front().frame);
     messageQueue_.pop_front();
     return true;
+}
+
+bool DeviceWaitForPreConnect::getQueueMessage(Bytes& data) {
+    std::lock_guard<std::mutex> lock(messageLock_);
+    return takeOldestLocked(data);
+}
+
+bool DeviceWaitForPreConnect::waitQueueMessage(Bytes& data, std::chrono::steady_clock::time_point deadline) {
+    std::unique_lock<std::mutex> lock(messageLock_);
+    for (;;) {
+        if (takeOldestLocked(data)) return true;
+        if (!isConnected_ || heldLinkEnded_) return false;
+        if (messageArrived_.wait_until(lock, deadline) == std::cv_status::timeout) return takeOldestLocked(data);
+    }
 }
 
 void DeviceWaitForPreConnect::clearQueueMessage() {

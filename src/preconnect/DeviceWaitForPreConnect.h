@@ -8,6 +8,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
 #include <deque>
 #include <memory>
 #include <mutex>
@@ -60,6 +61,7 @@ public:
 
     // The oldest frame the phone sent on the held link (not a request to connect).
     bool getQueueMessage(Bytes& data) override;
+    bool waitQueueMessage(Bytes& data, std::chrono::steady_clock::time_point deadline) override;
     void clearQueueMessage() override;
     std::size_t queuedMessages() const;
 
@@ -91,6 +93,8 @@ private:
     // One [24] request: [25] at once, then the PC suite's answer as [27].
     asio::awaitable<void> mobileAskConnectPC(std::string data);
     void queueMessage(Bytes frame);
+    // The oldest frame young enough to be an answer; under messageLock_.
+    bool takeOldestLocked(Bytes& data);
     Json envelope(int tag) const;
 
     EventLoop& loop_;
@@ -113,8 +117,10 @@ private:
         std::chrono::steady_clock::time_point at;
     };
     mutable std::mutex messageLock_;
+    std::condition_variable messageArrived_;  // a frame queued, the link ended or was let go
     std::deque<Queued> messageQueue_;
     std::size_t queuedBytes_ = 0;
+    bool heldLinkEnded_ = true;  // guarded by messageLock_
 };
 
 }  // namespace kesu

@@ -36,6 +36,7 @@ public:
     static DeviceWaitForPreConnectManager& instance();
     explicit DeviceWaitForPreConnectManager(EventLoop* loop = nullptr);
     void setEventLoop(EventLoop* loop);
+    EventLoop* eventLoop() const { return loop_.load(); }
     // Whoever reports the pre-connect device list to the PC suite (wired by the composition
     // root) hears of every change of an entry's state through notifyListChanged.
     void setListChangedHandler(std::function<void()> handler);

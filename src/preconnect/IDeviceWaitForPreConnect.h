@@ -4,6 +4,7 @@
 
 #include <asio/awaitable.hpp>
 
+#include <chrono>
 #include <memory>
 #include <string>
 
@@ -45,6 +46,10 @@ public:
     virtual void addConnectCount() {}
     virtual bool getIsDisconnectNow() const { return false; }
     virtual bool getQueueMessage(Bytes&) { return false; }
+    // The oldest frame the phone sent on the held link, waiting for one until `deadline`;
+    // false at the deadline, or at once when the link is not (or no longer) held. Blocks:
+    // never called on the event loop.
+    virtual bool waitQueueMessage(Bytes& data, std::chrono::steady_clock::time_point) { return getQueueMessage(data); }
     virtual void clearQueueMessage() {}
     virtual bool isFirstConnection() const { return false; }
     virtual std::string getPreConnectStep() const { return {}; }
