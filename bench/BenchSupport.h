@@ -1,11 +1,13 @@
 // Pieces shared by the benchmarks: percentiles, a phone's announcement as it travels on the
 // LAN, the real service with its control API client, started in network namespaces by
-// the tests' own helpers (tests/support), and the figures /proc gives about a process.
+// the tests' own helpers (tests/support), the service signed in to an account whose cloud
+// device list a stand-in connect center serves, and the figures /proc gives about a process.
 #pragma once
 
 #include <httplib.h>
 #include <dirent.h>
 #include <signal.h>
+#include <sqlite3.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -13,6 +15,7 @@
 #include <chrono>
 #include <cstdio>
 #include <exception>
+#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <map>
@@ -24,10 +27,13 @@
 #include <utility>
 #include <vector>
 
+#include "core/Config.h"
 #include "core/Json.h"
 #include "discovery/Base64.h"
+#include "discovery/SsdpMessage.h"
 #include "support/NetNs.h"
 #include "support/ServiceProcess.h"
+#include "support/StubPcSuite.h"
 #include "support/TestSupport.h"
 
 namespace kesu::bench {
@@ -41,6 +47,24 @@ inline double percentile(std::vector<double> v, double p) {
 }
 
 inline double micros(Clock::duration d) { return std::chrono::duration<double, std::micro>(d).count(); }
+
+struct Spread {
+    double p50 = 0, p90 = 0, p99 = 0, max = 0;
+};
+inline Spread spread(const std::vector<double>& v) {
+    return {percentile(v, 0.5), percentile(v, 0.9), percentile(v, 0.99), percentile(v, 1.0)};
+}
+inline double ratio(double a, double b) { return b > 0 ? a / b : 0; }
+
+// The value of `--name=N` on the command line; else `quick` under KESU_BENCH_QUICK, else
+// `fallback`.
+inline int option(int argc, char** argv, const std::string& name, int fallback, int quick) {
+    for (int i = 1; i < argc; ++i) {
+        const std::string arg = argv[i];
+        if (arg.rfind("--" + name + "=", 0) == 0) return std::atoi(arg.c_str() + name.size() + 3);
+    }
+    return std::getenv("KESU_BENCH_QUICK") ? quick : fallback;
+}
 
 // A phone announcement in the current format.
 inline std::string phoneAnnouncement(const std::string& id) {
@@ -61,6 +85,13 @@ inline std::string phoneAnnouncement(const std::string& id) {
 inline std::string controlBody(const std::string& event, const Json& args = Json::array()) {
     const std::string text = json::compact(Json{{"event", event}, {"args", args}});
     return std::to_string(text.size()) + "#" + text;
+}
+
+// The JSON of a control answer ("<length>#<json>"); nullopt when it is not one.
+inline std::optional<Json> controlAnswerJson(const std::string& answer) {
+    const auto hash = answer.find('#');
+    if (hash == std::string::npos) return std::nullopt;
+    return json::parse(std::string_view(answer).substr(hash + 1));
 }
 
 // The real service binary, started the way the end-to-end tests start it: in the network
@@ -117,6 +148,134 @@ private:
     test::TempDir dir_;
     std::unique_ptr<test::ServiceProcess> process_;
     httplib::Client client_{"127.0.0.1", 9197};
+};
+
+// Announces a phone (`announce` sends one datagram) and asks SSDPQueryAll back to back until
+// the service lists the phone announced as `id`, for at most `timeout`; each query's round
+// trip goes to `queries` when given.
+struct Appearance {
+    bool listed = false;
+    double micros = 0;  // from the announcement to the answer that listed it, or to giving up
+};
+inline Appearance announceUntilListed(BenchService& service, const std::function<void()>& announce,
+                                      const std::string& id, std::chrono::milliseconds timeout,
+                                      std::vector<double>* queries = nullptr) {
+    static const std::string queryAll = controlBody("SSDPQueryAll");
+    // Built piecewise: g++ 12 sees a bogus overlap (-Wrestrict) in "\"" + text.
+    std::string wanted = SsdpMessage::deviceIdentifier(id);
+    wanted.insert(wanted.begin(), '"');
+    wanted.push_back('"');
+    const auto t0 = Clock::now();
+    announce();
+    while (Clock::now() - t0 < timeout) {
+        const auto q0 = Clock::now();
+        const auto answer = service.control(queryAll);
+        if (queries) queries->push_back(micros(Clock::now() - q0));
+        if (answer && answer->find(wanted) != std::string::npos) return {true, micros(Clock::now() - t0)};
+    }
+    std::fprintf(stderr, "announcement %s never appeared\n", id.c_str());
+    return {false, micros(Clock::now() - t0)};
+}
+
+// The PC suite's account database with one signed-in user, written beside and renamed over.
+inline bool writeAccount(const std::string& home, const std::string& openId) {
+    const std::string folder = home + "/Library/Application Support/pcsuite/DataBase";
+    std::filesystem::create_directories(folder);
+    const std::string path = folder + "/Config.db", fresh = path + ".new";
+    std::filesystem::remove(fresh);
+    sqlite3* db = nullptr;
+    if (sqlite3_open(fresh.c_str(), &db) != SQLITE_OK) {
+        sqlite3_close(db);
+        return false;
+    }
+    const std::string sql =
+        "CREATE TABLE User (openid TEXT, phone TEXT, token TEXT);"
+        "CREATE TABLE SoftwareSet (openid TEXT, configDir TEXT, storageDir TEXT);"
+        "INSERT INTO User VALUES ('" + openId + "', '13800000000', 'tok');";
+    const int rc = sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr);
+    sqlite3_close(db);
+    std::error_code ec;
+    std::filesystem::rename(fresh, path, ec);
+    return rc == SQLITE_OK && !ec;
+}
+
+// A phone of the account as the cloud lists it.
+struct CloudPhone {
+    std::string ip;          // its one address
+    std::string businessId;  // its first 4 characters make the device key
+};
+
+// The connect center's device list of the account `openId`.
+inline std::string cloudDeviceList(const std::string& openId, const std::vector<CloudPhone>& phones) {
+    Json data = Json::array();
+    for (std::size_t i = 0; i < phones.size(); ++i) {
+        const Json net = {{"inet", phones[i].ip}, {"localInet", phones[i].ip}, {"netmark", "255.255.255.0"}, {"ssid", "Home"}};
+        data.push_back({{"userId", openId},
+                        {"name", "Bench Phone " + std::to_string(i)},
+                        {"type", 1},
+                        {"model", "SIM-1"},
+                        {"reportTime", "2026-12-06 10:00:00.000"},
+                        {"deviceId", "cloud-" + std::to_string(i)},
+                        {"bizInfo", {{"conn_base", {{"businessId", phones[i].businessId}, {"cloudConnectionSupported", true}}}}},
+                        {"inets", Json::array({net})}});
+    }
+    return Json{{"code", 0}, {"data", data}}.dump();
+}
+
+// The real service signed in to `openId`, beside a stand-in HTTP server (in the same
+// namespace, at the PC suite's port) that plays the PC suite and the connect center (named by
+// switch_host.ini). Once ok(), the service has fetched the account's (empty) device list;
+// list() has it fetch a new one. Construct it on a thread in the service's namespace.
+class SignedInService {
+public:
+    SignedInService(const std::string& netns, std::string openId)
+        : openId_(std::move(openId)), center_("0.0.0.0", Config().pcsuitePort) {
+        center_.setAnswer("/pcDeviceInfo", {200, R"({"code":"000000","data":{"deviceId":"BENCHPC0001","version":"1.0.0"}})"});
+        center_.setAnswer("/device/report", {200, R"({"code":0})"});
+        center_.setAnswer("/device/unBind", {200, R"({"code":0})"});
+        center_.setAnswer("/device/list", {200, cloudDeviceList(openId_, {})});
+        const std::string centerUrl = "http://127.0.0.1:" + std::to_string(Config().pcsuitePort);
+        bool prepared = false;
+        service_ = std::make_unique<BenchService>(netns, [&](const std::string& home, const std::string& root) {
+            const std::filesystem::path ini = root + Config().switchHostIni;
+            std::filesystem::create_directories(ini.parent_path());
+            std::ofstream(ini) << "ConnectionCenterHost=" << centerUrl << "\n";
+            prepared = writeAccount(home, openId_);
+        });
+        if (!prepared || !service_->process() || !service_->waitUntilUp()) {
+            error_ = "the service did not start (account written: " + std::to_string(prepared) + ")";
+            return;
+        }
+        // The account read at start-up is announced before the cloud subscriber listens: the
+        // database written anew is what has the service fetch the (empty) list.
+        if (!list({})) error_ = "the service never asked the connect center for the device list";
+    }
+
+    bool ok() const { return error_.empty(); }
+    const std::string& error() const { return error_; }
+    BenchService& service() { return *service_; }
+    test::StubPcSuite& center() { return center_; }
+    const std::string& openId() const { return openId_; }
+
+    // Has the service fetch the list naming `phones` (the account database written anew);
+    // the fetch as the center saw it, or nullopt when it did not come within 30 s.
+    std::optional<test::RecordedRequest> list(const std::vector<CloudPhone>& phones) {
+        const auto from = Clock::now();
+        center_.setAnswer("/device/list", {200, cloudDeviceList(openId_, phones)});
+        if (!writeAccount(service_->home(), openId_)) return std::nullopt;
+        return center_.waitForRequest(
+            [&](const test::RecordedRequest& r) { return r.path == "/device/list" && r.receivedAt >= from; },
+            std::chrono::seconds(30));
+    }
+
+    // The service's log line telling that the device `key` is held.
+    static std::string heldMarker(const std::string& key = {}) { return "preConnect result is success, id " + key; }
+
+private:
+    std::string openId_;
+    test::StubPcSuite center_;
+    std::unique_ptr<BenchService> service_;
+    std::string error_;
 };
 
 // Makes the lab `nodes` describe (names and hosts of an unbridged NetNsLab tagged "bench"),

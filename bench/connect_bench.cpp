@@ -95,22 +95,11 @@ int measure(const NetNsLab::Node& pc, const NetNsLab::Node& phoneNode, int conne
                 const std::string datagram = phoneAnnouncement(id);
                 ::sendto(udp, datagram.data(), datagram.size(), 0, reinterpret_cast<sockaddr*>(&group), sizeof group);
             };
-            const std::string queryAll = controlBody("SSDPQueryAll");
-            // Announces `id`, then asks SSDPQueryAll back to back until it shows (at most 5 s);
-            // each query's round trip goes to `query`.
+            // Announces `id` and waits (at most 5 s) until SSDPQueryAll lists it; each query's
+            // round trip goes to `query`.
             std::vector<double> query;
             const auto announceAndAwait = [&](const std::string& id) {
-                const std::string wanted = "\"" + kesu::SsdpMessage::deviceIdentifier(id) + "\"";
-                const auto t0 = Clock::now();
-                announce(id);
-                while (Clock::now() - t0 < std::chrono::seconds(5)) {
-                    const auto q0 = Clock::now();
-                    const auto answer = service.control(queryAll);
-                    query.push_back(micros(Clock::now() - q0));
-                    if (answer && answer->find(wanted) != std::string::npos) return micros(Clock::now() - t0);
-                }
-                std::fprintf(stderr, "announcement %s never appeared\n", id.c_str());
-                return micros(Clock::now() - t0);
+                return announceUntilListed(service, [&] { announce(id); }, id, std::chrono::seconds(5), &query).micros;
             };
 
             // Announcement to table: a new id each round.

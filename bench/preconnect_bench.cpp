@@ -13,7 +13,6 @@
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
-#include <sqlite3.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -24,8 +23,6 @@
 #include <cstdio>
 #include <cstdlib>
 #include <deque>
-#include <filesystem>
-#include <fstream>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -58,53 +55,6 @@ std::string businessId(int i) {
     char id[16];
     std::snprintf(id, sizeof id, "B%03dPHONE", i);
     return id;
-}
-
-int option(int argc, char** argv, const std::string& name, int fallback, int quick) {
-    for (int i = 1; i < argc; ++i) {
-        const std::string arg = argv[i];
-        if (arg.rfind("--" + name + "=", 0) == 0) return std::atoi(arg.c_str() + name.size() + 3);
-    }
-    return std::getenv("KESU_BENCH_QUICK") ? quick : fallback;
-}
-
-// The PC suite's account database with one signed-in user, written beside and renamed over.
-bool writeAccount(const std::string& home) {
-    const std::string folder = home + "/Library/Application Support/pcsuite/DataBase";
-    std::filesystem::create_directories(folder);
-    const std::string path = folder + "/Config.db", fresh = path + ".new";
-    std::filesystem::remove(fresh);
-    sqlite3* db = nullptr;
-    if (sqlite3_open(fresh.c_str(), &db) != SQLITE_OK) {
-        sqlite3_close(db);
-        return false;
-    }
-    const std::string sql =
-        "CREATE TABLE User (openid TEXT, phone TEXT, token TEXT);"
-        "CREATE TABLE SoftwareSet (openid TEXT, configDir TEXT, storageDir TEXT);"
-        "INSERT INTO User VALUES ('" + kOpenId + "', '13800000000', 'tok');";
-    const int rc = sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr);
-    sqlite3_close(db);
-    std::error_code ec;
-    std::filesystem::rename(fresh, path, ec);
-    return rc == SQLITE_OK && !ec;
-}
-
-// The cloud's list naming the first `count` phones.
-std::string deviceList(int count) {
-    kesu::Json data = kesu::Json::array();
-    for (int i = 0; i < count; ++i) {
-        kesu::Json net = {{"inet", phoneIp(i)}, {"localInet", phoneIp(i)}, {"netmark", "255.255.255.0"}, {"ssid", "Home"}};
-        data.push_back({{"userId", kOpenId},
-                        {"name", "Bench Phone " + std::to_string(i)},
-                        {"type", 1},
-                        {"model", "SIM-1"},
-                        {"reportTime", "2026-12-06 10:00:00.000"},
-                        {"deviceId", "cloud-" + std::to_string(i)},
-                        {"bizInfo", {{"conn_base", {{"businessId", businessId(i)}, {"cloudConnectionSupported", true}}}}},
-                        {"inets", kesu::Json::array({net})}});
-    }
-    return kesu::Json{{"code", 0}, {"data", data}}.dump();
 }
 
 // What one simulated phone saw, stamped as it happened on the phone's serving thread.
@@ -189,14 +139,6 @@ private:
     std::thread thread_;
 };
 
-struct Spread {
-    double p50 = 0, p90 = 0, p99 = 0, max = 0;
-};
-Spread spread(const std::vector<double>& v) {
-    return {percentile(v, 0.5), percentile(v, 0.9), percentile(v, 0.99), percentile(v, 1.0)};
-}
-double ratio(double a, double b) { return b > 0 ? a / b : 0; }
-
 void printIdle(const proc::Rates& none, const proc::Rates& held) {
     std::printf("\n1. idle service, %.1f s windows           0 links    20 links     ratio   target\n", held.seconds);
     std::printf("   CPU seconds / s                    %10.5f  %10.5f  %8.2f   within noise of 0 links\n",
@@ -256,33 +198,14 @@ int run(const test::NetNsLab::Node& pc, const test::NetNsLab::Node& phone, int s
     }
 
     // The connect center and the PC suite, at the PC suite's address in the service's namespace.
+    SignedInService signedIn(pc.ns, kOpenId);
+    if (!signedIn.ok()) {
+        std::fprintf(stderr, "%s\n", signedIn.error().c_str());
+        return 1;
+    }
+    BenchService& service = signedIn.service();
     const kesu::Config defaults;
-    test::StubPcSuite center("0.0.0.0", defaults.pcsuitePort);
-    center.setAnswer("/pcDeviceInfo", {200, R"({"code":"000000","data":{"deviceId":"BENCHPC0001","version":"1.0.0"}})"});
-    center.setAnswer("/device/report", {200, R"({"code":0})"});
-    center.setAnswer("/device/unBind", {200, R"({"code":0})"});
-    center.setAnswer("/device/list", {200, deviceList(0)});
-    const std::string centerUrl = "http://127.0.0.1:" + std::to_string(defaults.pcsuitePort);
-
-    bool prepared = false;
-    BenchService service(pc.ns, [&](const std::string& home, const std::string& root) {
-        const std::filesystem::path ini = root + defaults.switchHostIni;
-        std::filesystem::create_directories(ini.parent_path());
-        std::ofstream(ini) << "ConnectionCenterHost=" << centerUrl << "\n";
-        prepared = writeAccount(home);
-    });
-    if (!prepared || !service.process() || !service.waitUntilUp()) {
-        std::fprintf(stderr, "the service did not start (account written: %d)\n", prepared);
-        return 1;
-    }
     const pid_t pid = proc::serviceProcess(service.pid());
-    // The account read at start-up is announced before the cloud subscriber listens: the
-    // database written anew is what has the service fetch the (empty) list.
-    const auto isList = [](const test::RecordedRequest& r) { return r.path == "/device/list"; };
-    if (!writeAccount(service.home()) || !center.waitForRequest(isList, 30s)) {
-        std::fprintf(stderr, "the service never asked the connect center for the device list\n");
-        return 1;
-    }
     std::printf("pre-connect bench: service pid %d, %d phones at %s..%s port %d, windows of %d s after %d s settling\n",
                 pid, kPhones, phoneIp(0).c_str(), phoneIp(kPhones - 1).c_str(), phonePort, seconds, settle);
     std::fflush(stdout);
@@ -294,21 +217,16 @@ int run(const test::NetNsLab::Node& pc, const test::NetNsLab::Node& phone, int s
     const proc::Rates none = proc::between(first, proc::usage(pid));
 
     // The list names the phones; the account written anew has the service fetch it.
-    const auto listedFrom = Clock::now();
-    center.setAnswer("/device/list", {200, deviceList(kPhones)});
-    if (!writeAccount(service.home())) {
-        std::fprintf(stderr, "could not write the account database anew\n");
-        return 1;
-    }
-    const auto listed =
-        center.waitForRequest([&](const test::RecordedRequest& r) { return isList(r) && r.receivedAt >= listedFrom; }, 30s);
+    std::vector<CloudPhone> listedPhones;
+    for (int i = 0; i < kPhones; ++i) listedPhones.push_back({phoneIp(i), businessId(i)});
+    const auto listed = signedIn.list(listedPhones);
     if (!listed) {
         std::fprintf(stderr, "the service did not fetch the device list again\n");
         return 1;
     }
 
     // Held: the service's log line for each device, stamped when it was printed.
-    const std::string marker = "preConnect result is success, id ";
+    const std::string marker = SignedInService::heldMarker();
     std::map<std::string, Clock::time_point> held;
     std::size_t from = 0;
     const auto heldBy = Clock::now() + std::chrono::seconds(kPhones * 4 + 30);

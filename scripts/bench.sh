@@ -12,6 +12,7 @@ fi
 quick_args() {
   case "$1" in
     connect_bench) echo "30 5" ;;
+    connectflow_bench) echo "--trips=40" ;;
     control_bench) echo "200 1" ;;
     idle_bench) echo "--seconds=2 --settle=1" ;;
     preconnect_bench) echo "--seconds=10 --settle=3 --trips=50" ;;
