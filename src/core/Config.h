@@ -149,6 +149,9 @@ struct Config {
     std::string machineInfoFile = "/etc/machine-info";
     std::string ufwConfigFile = "/etc/ufw/ufw.conf";
     std::chrono::milliseconds platformCommandTimeout{2000};
+    // The PC's name and hardware address, which every connection request carries, are read
+    // again once they are this old.
+    std::chrono::milliseconds identityCacheLifetime{5000};
     std::chrono::milliseconds platformToolRetry{60000};
 
     // The process-wide configuration. Set it up before anything is started.

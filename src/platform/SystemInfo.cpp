@@ -4,9 +4,11 @@
 
 #include <algorithm>
 #include <array>
+#include <chrono>
 #include <mutex>
 #include <nlohmann/json.hpp>
 
+#include "core/Config.h"
 #include "core/Log.h"
 #include "core/Text.h"
 #include "platform/Platform.h"
@@ -33,6 +35,43 @@ AdapterNames& adapterNames() {
 std::string readName(const std::string& name) {
     std::lock_guard<std::mutex> guard(adapterNames().lock);
     return name;
+}
+
+// A value that is costly to read (files, the interface walk) and rarely changes, read again
+// once it is older than Config::identityCacheLifetime. Every connection request names the PC.
+class CachedText {
+public:
+    template <class Read>
+    std::string get(Read read) {
+        const auto now = std::chrono::steady_clock::now();
+        std::lock_guard<std::mutex> guard(lock_);
+        if (!valid_ || now - readAt_ >= Config::current().identityCacheLifetime) {
+            value_ = read();
+            readAt_ = now;
+            valid_ = true;
+        }
+        return value_;
+    }
+    void forget() {
+        std::lock_guard<std::mutex> guard(lock_);
+        valid_ = false;
+    }
+
+private:
+    std::mutex lock_;
+    bool valid_ = false;
+    std::chrono::steady_clock::time_point readAt_;
+    std::string value_;
+};
+
+CachedText& cachedHostName() {
+    static auto* cache = new CachedText();
+    return *cache;
+}
+
+CachedText& cachedHardwareAddress() {
+    static auto* cache = new CachedText();
+    return *cache;
 }
 
 std::string withoutColons(std::string text) {
@@ -67,9 +106,13 @@ bool hasAdapterWithAddress(const std::string& displayName) {
 
 std::string SystemInfo::getLocalName() { return text::paramAddMask(getFullLocalName()); }
 
-std::string SystemInfo::getFullLocalName() { return Platform::current().localizedHostName(); }
+std::string SystemInfo::getFullLocalName() {
+    return cachedHostName().get([] { return Platform::current().localizedHostName(); });
+}
 
-std::string SystemInfo::getMacAddress() { return withoutColons(primaryHardwareAddress()); }
+std::string SystemInfo::getMacAddress() {
+    return cachedHardwareAddress().get([] { return withoutColons(primaryHardwareAddress()); });
+}
 
 std::string SystemInfo::getBluetoothMacAddress() { return Platform::current().bluetoothAddress(); }
 
@@ -202,6 +245,8 @@ bool SystemInfo::isAppRunning(const std::string& appName) {
 }
 
 void SystemInfo::resetForTest() {
+    cachedHostName().forget();
+    cachedHardwareAddress().forget();
     AdapterNames& names = adapterNames();
     std::lock_guard<std::mutex> guard(names.lock);
     names.wifi = defaultWifiName;

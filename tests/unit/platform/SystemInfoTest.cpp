@@ -82,7 +82,19 @@ TEST_F(SystemInfoTest, MaskCountsUserPerceivedCharacters) {
 }
 
 TEST_F(SystemInfoTest, MacAddressAndNetworkSnapshot) {
-    // The first Wi-Fi adapter, else the last Ethernet one.
+    // The first Wi-Fi adapter, else the last Ethernet one; read anew once the last read is
+    // older than the cache's lifetime.
+    env.config().identityCacheLifetime = std::chrono::hours(1);
+    fake->setLocalizedHostName("Desk");
+    EXPECT_EQ(SystemInfo::getFullLocalName(), "Desk");
+    EXPECT_EQ(SystemInfo::getMacAddress(), "");
+    fake->setLocalizedHostName("Other");
+    fake->addAdapter("Ethernet", "eth9", "aa:00:00:00:00:09");
+    EXPECT_EQ(SystemInfo::getFullLocalName(), "Desk");
+    EXPECT_EQ(SystemInfo::getMacAddress(), "");
+    env.config().identityCacheLifetime = std::chrono::milliseconds(0);
+    EXPECT_EQ(SystemInfo::getFullLocalName(), "Other");
+    fake->setNetworkServices({});
     EXPECT_EQ(SystemInfo::getMacAddress(), "");
     fake->addAdapter("Ethernet", "eth0", "aa:00:00:00:00:01");
     fake->addAdapter("Ethernet", "eth1", "aa:00:00:00:00:02", "10.1.0.5", "255.255.0.0");
