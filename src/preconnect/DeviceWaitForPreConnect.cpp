@@ -395,14 +395,16 @@ asio::awaitable<void> DeviceWaitForPreConnect::recvMessageAndHeartbeatLoop(int c
     held->ended = true;
     held->wake.cancel();
     held->link->shut();
-    {
-        std::lock_guard<std::mutex> lock(messageLock_);
-        heldLinkEnded_ = true;
-    }
-    messageArrived_.notify_all();
 
     const auto device = getFarawayDevice();
     const std::string deviceId = device ? device->getDeviceId() : std::string();
+    if (!device || device->getClientId() == clientId) {  // not when a newer link is held already
+        {
+            std::lock_guard<std::mutex> lock(messageLock_);
+            heldLinkEnded_ = true;
+        }
+        messageArrived_.notify_all();
+    }
     Log::mPrintlog("[DeviceWaitForPreConnect::recvMessageAndHeartbeatLoop] device " + deviceId +
                      " heartbeat is alnormal");
     Log::mPrintlog("[DeviceWaitForPreConnect::recvMessageAndHeartbeatLoop] recvMessageAndHeartbeatLoop is ready to quit");
