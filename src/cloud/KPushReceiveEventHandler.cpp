@@ -1,6 +1,5 @@
 #include "cloud/KPushReceiveEventHandler.h"
 
-#include <climits>
 #include <map>
 #include <optional>
 
@@ -50,16 +49,10 @@ std::optional<std::string> stringMember(const std::string& tag, const Json& pare
     return std::nullopt;
 }
 
-// An integer that fits a long long (a larger one is no event type).
 std::optional<long long> integerMember(const std::string& tag, const Json& parent, const std::string& key) {
-    if (parent.is_object()) {
-        const auto it = parent.find(key);
-        if (it != parent.end() && it->is_number_integer() &&
-            !(it->is_number_unsigned() && it->get<unsigned long long>() > static_cast<unsigned long long>(LLONG_MAX)))
-            return it->get<long long>();
-    }
-    logAbsent(tag, parent, key, "an integer");
-    return std::nullopt;
+    const auto value = json::exactInteger(parent, key);
+    if (!value) logAbsent(tag, parent, key, "an integer");
+    return value;
 }
 
 std::string reply(int error, const std::string& message) {

@@ -1,5 +1,7 @@
 #include "core/Json.h"
 
+#include <limits>
+
 #include "core/Text.h"
 
 namespace kesu::json {
@@ -24,6 +26,16 @@ long long integer(const Json& j, const std::string& key) {
     if (it->is_number_integer()) return it->get<long long>();
     if (it->is_number_float()) return static_cast<long long>(it->get<double>());
     return 0;
+}
+
+std::optional<long long> exactInteger(const Json& j, const std::string& key) {
+    if (!j.is_object()) return std::nullopt;
+    const auto it = j.find(key);
+    if (it == j.end() || !it->is_number_integer()) return std::nullopt;
+    if (it->is_number_unsigned() &&
+        it->get<unsigned long long>() > static_cast<unsigned long long>(std::numeric_limits<long long>::max()))
+        return std::nullopt;
+    return it->get<long long>();
 }
 
 bool boolean(const Json& j, const std::string& key) {

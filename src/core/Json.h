@@ -23,6 +23,9 @@ std::optional<Json> parse(std::string_view text);
 
 std::string str(const Json& j, const std::string& key);  // "" unless a string member
 long long integer(const Json& j, const std::string& key);  // 0 unless a number member
+// An integer member that a long long holds; nullopt for another type, a fraction or a
+// larger number.
+std::optional<long long> exactInteger(const Json& j, const std::string& key);
 bool boolean(const Json& j, const std::string& key);       // false unless a bool member
 Json array(const Json& j, const std::string& key);         // [] unless an array member
 Json object(const Json& j, const std::string& key);        // {} unless an object member

@@ -1,7 +1,5 @@
 #include "pcsuite/PcsuiteRequest.h"
 
-#include <climits>
-
 #include "core/Endpoints.h"
 #include "core/Log.h"
 
@@ -54,16 +52,10 @@ std::optional<Json> PcsuiteRequest::startConnectPreDevice(const std::map<std::st
 
 std::optional<ConnectDeviceOutcome> PcsuiteRequest::connectDeviceOutcome(const Json& answer) {
     const Json data = json::object(answer, "data");
-    const auto code = data.find("code");
+    const auto code = json::exactInteger(data, "code");
     const auto reason = data.find("reason");
-    if (code == data.end() || reason == data.end() || !reason->is_string()) return std::nullopt;
-    // An integer the result code can hold; a larger one is no code of the PC suite's.
-    if (code->is_number_unsigned()) {
-        if (code->get<unsigned long long>() > static_cast<unsigned long long>(LLONG_MAX)) return std::nullopt;
-    } else if (!code->is_number_integer()) {
-        return std::nullopt;
-    }
-    return ConnectDeviceOutcome{code->get<long long>(), reason->get<std::string>()};
+    if (!code || reason == data.end() || !reason->is_string()) return std::nullopt;
+    return ConnectDeviceOutcome{*code, reason->get<std::string>()};
 }
 
 }  // namespace kesu
