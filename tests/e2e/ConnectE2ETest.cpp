@@ -25,8 +25,10 @@ const std::string kPressAgree =
     "body='{\"event\":\"QtAgree\",\"args\":[\"true\"]}'\n"
     "curl -s -m 5 --data-binary \"${#body}#$body\" http://127.0.0.1:9197/ >/dev/null\n";
 
-json bodyOf(const ServiceProcess& sim, const std::string& marker) {
-    return json::parse(lineAfter(sim.output(), marker), nullptr, false);
+// The first body the phone printed after `marker`, once its whole line is there.
+json bodyOf(ServiceProcess& sim, const std::string& marker) {
+    const auto bodies = printedBodies(sim, marker, 1);
+    return bodies.empty() ? json() : bodies.front();
 }
 
 class ConnectE2E : public LabTest {

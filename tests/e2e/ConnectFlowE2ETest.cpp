@@ -29,7 +29,7 @@ json reply(int error, const std::string& message, const std::string& data, const
 }
 
 // The connection requests ([0]) a phone received, in order.
-std::vector<json> connectRequests(const ServiceProcess& sim) {
+std::vector<json> connectRequests(ServiceProcess& sim) {
     std::vector<json> requests;
     for (json& body : receivedBodies(sim))
         if (body.is_object() && body.value("bytes", json()) == json::array({0})) requests.push_back(std::move(body));

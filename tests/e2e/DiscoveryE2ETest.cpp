@@ -14,13 +14,16 @@ namespace {
 
 using DiscoveryE2E = LabTest;
 
-// The JSON of the last PC announcement the simulator printed.
-nlohmann::json lastAnnouncement(const ServiceProcess& sim) {
-    const std::string out = sim.output();
-    const std::string marker = "SIM PC_ANNOUNCE ";
-    const auto at = out.rfind(marker);
-    if (at == std::string::npos) return nullptr;
-    return nlohmann::json::parse(lineAfter(out.substr(at), marker), nullptr, false);
+// The first PC announcement the simulator printed in whole that names `openId` (null when
+// none came within the time-out).
+nlohmann::json announcementFor(ServiceProcess& sim, const std::string& openId, std::chrono::milliseconds timeout) {
+    const auto named = [&](const std::string& out) {
+        for (const auto& j : bodiesIn(out, "SIM PC_ANNOUNCE "))
+            if (j.is_object() && j.value("openId", "") == openId) return j;
+        return nlohmann::json();
+    };
+    sim.waitForOutput([&](const std::string& out) { return !named(out).is_null(); }, timeout);
+    return named(sim.output());
 }
 
 // The device with `id` in a posted device list (null when absent or not a list).
@@ -36,17 +39,14 @@ TEST_F(DiscoveryE2E, PhoneHearsThePcAnnouncement) {
     writeAccount("pc-open-1", "13912345678");
     auto service = startService();
     auto sim = startSimulator(phone.ns, {"--iface-ip", phone.ip, "--listen", "--duration", "20"});
-    ASSERT_TRUE(sim->waitForOutput("SIM PC_ANNOUNCE {", 8s)) << sim->output() << "\n--- service:\n"
-                                                              << service->output();
+    const auto j = announcementFor(*sim, "pc-open-1", 8s);
+    ASSERT_TRUE(j.is_object()) << sim->output() << "\n--- service:\n" << service->output();
     EXPECT_EQ(sim->output().find("UDP_BAD_ENVELOPE"), std::string::npos) << sim->output();
     EXPECT_EQ(lineAfter(sim->output(), "SIM PC_ANNOUNCE_FROM "), pc.ip);
 
-    auto j = lastAnnouncement(*sim);
-    ASSERT_TRUE(j.is_object());
     // The body's fixed members are checked where it is built; here what comes from the
     // account file.
     EXPECT_EQ(j["deviceType"], "pc");
-    EXPECT_EQ(j["openId"], "pc-open-1");
     EXPECT_EQ(j["account"], "139****678");  // the account's phone is kept masked
     EXPECT_TRUE(j["deviceName"].is_string() && j["deviceId"].is_string());
 
@@ -133,15 +133,14 @@ TEST_F(DiscoveryE2E, AccountChangeReachesTheNextAnnouncement) {
     writeAccount("first-open-id", "13900000001");
     auto service = startService();
     auto sim = startSimulator(phone.ns, {"--iface-ip", phone.ip, "--listen", "--duration", "60"});
-    ASSERT_TRUE(sim->waitForOutput("\"openId\":\"first-open-id\"", 10s)) << sim->output();
+    ASSERT_TRUE(announcementFor(*sim, "first-open-id", 10s).is_object()) << sim->output();
 
     const auto logMark = service->output().size();
     writeAccount("second-open-id", "13900000002");
     // The monitor polls every 3 s: the change is read within one period and a little.
     ASSERT_TRUE(service->waitForOutput("DataBase file changed recently", 5s, logMark)) << service->output();
-    ASSERT_TRUE(sim->waitForOutput("\"openId\":\"second-open-id\"", 8s)) << sim->output();
-    const auto j = lastAnnouncement(*sim);
-    EXPECT_EQ(j["openId"], "second-open-id");
+    const auto j = announcementFor(*sim, "second-open-id", 8s);
+    ASSERT_TRUE(j.is_object()) << sim->output();
     EXPECT_EQ(j["account"], "139****002");
 }
 

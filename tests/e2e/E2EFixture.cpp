@@ -130,13 +130,25 @@ std::optional<std::vector<std::string>> LabTest::waitForLaunch(const std::string
     return args;
 }
 
-std::vector<nlohmann::json> receivedBodies(const ServiceProcess& sim) {
+std::vector<nlohmann::json> bodiesIn(const std::string& output, const std::string& marker) {
     std::vector<nlohmann::json> bodies;
-    const std::string out = sim.output();
-    const std::string marker = "SIM TCP_REQUEST ";
-    for (auto at = out.find(marker); at != std::string::npos; at = out.find(marker, at + 1))
-        bodies.push_back(nlohmann::json::parse(lineAfter(out.substr(at), marker), nullptr, false));
+    for (auto at = output.find(marker); at != std::string::npos; at = output.find(marker, at + 1)) {
+        const auto start = at + marker.size(), end = output.find('\n', start);
+        if (end == std::string::npos) break;
+        bodies.push_back(nlohmann::json::parse(output.substr(start, end - start), nullptr, false));
+    }
     return bodies;
+}
+
+std::vector<nlohmann::json> printedBodies(ServiceProcess& sim, const std::string& marker, std::size_t atLeast,
+                                          std::chrono::milliseconds timeout) {
+    if (atLeast > 0)
+        sim.waitForOutput([&](const std::string& out) { return bodiesIn(out, marker).size() >= atLeast; }, timeout);
+    return bodiesIn(sim.output(), marker);
+}
+
+std::vector<nlohmann::json> receivedBodies(ServiceProcess& sim, std::size_t atLeast) {
+    return printedBodies(sim, "SIM TCP_REQUEST ", atLeast);
 }
 
 void CloudLabTest::SetUp() {

@@ -63,9 +63,15 @@ protected:
     std::unique_ptr<StubPcSuite> recorder;  // in the PC node; receives the program launches
 };
 
-// The frame bodies a listening phone simulator received, in order (discarded JSON for a body
-// that is none).
-std::vector<nlohmann::json> receivedBodies(const ServiceProcess& sim);
+// The JSON after `marker` on each whole line of `output`, in order (discarded JSON for one
+// that is none). A line whose end has not arrived yet is not taken.
+std::vector<nlohmann::json> bodiesIn(const std::string& output, const std::string& marker);
+// bodiesIn() of a phone simulator's output, once it has printed at least `atLeast` such lines
+// or the time-out has passed.
+std::vector<nlohmann::json> printedBodies(ServiceProcess& sim, const std::string& marker, std::size_t atLeast,
+                                          std::chrono::milliseconds timeout = std::chrono::seconds(10));
+// The frame bodies a listening phone simulator received ("SIM TCP_REQUEST" lines).
+std::vector<nlohmann::json> receivedBodies(ServiceProcess& sim, std::size_t atLeast = 0);
 
 // The lab with the account's cloud: stand-ins for the PC suite (which names the PC "PC-E2E",
 // version "1.0") and for the connect center, whose device list names phones simulated in

@@ -88,7 +88,7 @@ TEST_F(PreconnectE2E, SignInPreconnectsTheListedPhoneWhichThenAsksToBeConnected)
     EXPECT_EQ(list->header("deviceId"), "PC-E2E");
 
     ASSERT_TRUE(service->waitForOutput(kSuccess + kAnsweringKey, 10s)) << service->output() << sim->output();
-    const auto asked = receivedBodies(*sim);
+    const auto asked = receivedBodies(*sim, 1);
     ASSERT_FALSE(asked.empty());
     EXPECT_EQ(asked[0]["bytes"], json::array({22})) << asked[0];
     EXPECT_EQ(asked[0]["open_Id"], kOpenId);
@@ -108,7 +108,7 @@ TEST_F(PreconnectE2E, SignInPreconnectsTheListedPhoneWhichThenAsksToBeConnected)
         << connect->body;
 
     ASSERT_TRUE(sim->waitForOutput("\"bytes\":[27]", 10s)) << sim->output() << service->output();
-    const auto bodies = receivedBodies(*sim);
+    const auto bodies = receivedBodies(*sim, 3);
     ASSERT_EQ(bodies.size(), 3u) << sim->output();
     EXPECT_EQ(bodies[1]["bytes"], json::array({25})) << bodies[1];
     EXPECT_EQ(bodies[2]["bytes"], json::array({27})) << bodies[2];

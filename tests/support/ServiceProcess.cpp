@@ -102,10 +102,16 @@ void ServiceProcess::readLoop(int fd) {
 }
 
 bool ServiceProcess::waitForOutput(const std::string& text, std::chrono::milliseconds timeout, std::size_t from) {
+    return waitForOutput(
+        [&](const std::string& out) { return from <= out.size() && out.find(text, from) != std::string::npos; },
+        timeout);
+}
+
+bool ServiceProcess::waitForOutput(const std::function<bool(const std::string&)>& done,
+                                   std::chrono::milliseconds timeout) {
     std::unique_lock<std::mutex> lock(mutex_);
-    const auto found = [&] { return from <= output_.size() && output_.find(text, from) != std::string::npos; };
-    cv_.wait_for(lock, timeout, [&] { return found() || outputClosed_; });
-    return found();
+    cv_.wait_for(lock, timeout, [&] { return done(output_) || outputClosed_; });
+    return done(output_);
 }
 
 std::string ServiceProcess::output() const {

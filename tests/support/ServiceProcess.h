@@ -6,6 +6,7 @@
 
 #include <chrono>
 #include <condition_variable>
+#include <functional>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -37,6 +38,9 @@ public:
     // Waits until the output from byte `from` on holds `text`; false at the time-out or when
     // the child ended without printing it.
     bool waitForOutput(const std::string& text, std::chrono::milliseconds timeout, std::size_t from = 0);
+    // Waits until `done` holds for the output so far; false at the time-out or when the
+    // child ended without it.
+    bool waitForOutput(const std::function<bool(const std::string&)>& done, std::chrono::milliseconds timeout);
     std::string output() const;
     // Waits for the child to end; its exit code (128+signal when killed), nullopt at the
     // time-out.
