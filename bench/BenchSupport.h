@@ -129,13 +129,12 @@ public:
     // The running child (its output), or null when it could not be started.
     test::ServiceProcess* process() { return process_.get(); }
 
-    // Waits (bounded, 10 s) until the control API answers.
+    // Waits (bounded, 20 s) until the service has started (the phone server, its last part,
+    // listens) and its control API answers.
     bool waitUntilUp() {
-        for (int i = 0; i < 100 && process_ && process_->running(); ++i) {
-            if (control(controlBody("HeartBeat"))) return true;
-            std::this_thread::sleep_for(std::chrono::milliseconds(100));
-        }
-        return false;
+        return process_ &&
+               process_->waitForOutput("[ConnectStatusGet] Server Socket is open", std::chrono::seconds(20)) &&
+               control(controlBody("HeartBeat"));
     }
     // One control request; the answer body, or nullopt when none came.
     std::optional<std::string> control(const std::string& body) {
