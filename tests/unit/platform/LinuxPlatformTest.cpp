@@ -260,7 +260,6 @@ bool inPrivateNetwork(const std::function<void()>& body) {
 
 TEST_F(LinuxPlatformTest, PingLoopbackAndUnansweredLoopback) {
     if (!process::findProgram("ping")) GTEST_SKIP() << "no ping";
-    EXPECT_TRUE(platform->ping("127.0.0.1", 2s));
     EXPECT_TRUE(SystemInfo::pingAddress("127.0.0.1", 2));
 
     if (::geteuid() != 0 || !process::findProgram("ip")) GTEST_SKIP() << "needs root and ip";
@@ -275,7 +274,6 @@ TEST_F(LinuxPlatformTest, PingLoopbackAndUnansweredLoopback) {
         if (!(ignore << "1" << std::flush)) return;
         ran = true;
         EXPECT_FALSE(SystemInfo::pingAddress("127.0.0.1", 1));
-        EXPECT_FALSE(platform->ping("127.0.0.1", 1s));
     });
     if (!entered || !ran) GTEST_SKIP() << "network namespaces are not available here";
 }
