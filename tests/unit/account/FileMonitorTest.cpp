@@ -16,7 +16,6 @@
 #include "support/UdpCatcher.h"
 #include "unit/account/AccountFixture.h"
 #include "unit/events/EventRecorder.h"
-#include "core/Log.h"
 
 namespace kesu::test {
 namespace {
@@ -315,7 +314,6 @@ TEST_F(FileMonitorTest, ServiceStartReadsWithoutWaitingAPeriodAndFillsTheDeviceI
 
     ASSERT_TRUE(fileMonitorStart(loop));
     EXPECT_EQ(dataInstance().get().pcDeviceId, "file-id");
-    EXPECT_EQ(dataInstance().get().version, Log::versionCode);
     EXPECT_FALSE(fileMonitorStart(loop));
     ASSERT_TRUE(events->waitFor("AccountChangeEvent", 1));
     EXPECT_EQ(openid(), "oid-1");
