@@ -79,8 +79,9 @@ TEST_F(ActiveConnectTest, PhoneAgreesWithTheRequestOnTheWire) {
     EXPECT_TRUE(ConnectionState::getWlanConnState());
 }
 
-// Every answer but agreement, silence and a hang-up; the link is closed after each.
-TEST_F(ActiveConnectTest, RefusalBusyOtherAnswersSilenceHangUpAndNoListener) {
+// Answers that are no answer, silence and a hang-up; the link is closed after each. Refusal
+// and busy answers are checked end to end (ConnectE2E).
+TEST_F(ActiveConnectTest, OtherAnswersSilenceHangUpAndNoListener) {
     const std::string timedOut = "[SSDP search] connect timeout or phone wake up pcsuite failed.";
     struct Case {
         const char* name;
@@ -89,8 +90,6 @@ TEST_F(ActiveConnectTest, RefusalBusyOtherAnswersSilenceHangUpAndNoListener) {
         std::string message, steps;
     };
     const std::vector<Case> cases = {
-        {"refused", answering(kAnswer, R"({"bytes":[2]})"), -10004, "[SSDP search] phone reject the connect.", "-3"},
-        {"busy", answering(kAnswer, R"({"bytes":[11]})"), -10001, "[SSDP search] phone is busy.", "-2"},
         {"other tag", answering(kAnswer, R"({"bytes":[23]})"), -10007, timedOut, "-1"},
         {"not UTF-8", answering(kAnswer, "{\"bytes\":[1],\"x\":\"\xff\"}"), -10007, timedOut, "-1"},
         {"silent", answering(kSilent), -10007, timedOut, "-1"},
@@ -122,11 +121,19 @@ TEST_F(ActiveConnectTest, DeviceWithoutAddress) {
                                       {"connection_steps", "_WI:0_WF:-1"}}));
 }
 
-TEST_F(ActiveConnectTest, CancelEndsTheWaitAtOnce) {
+// While an attempt waits, a second one is refused at once, through the control API or
+// called directly; a cancel ends the wait at once and frees the slot.
+TEST_F(ActiveConnectTest, SecondRequestIsBusyAndCancelEndsTheWaitAtOnce) {
     Phone phone(answering(kSilent));
     usePhone(phone);
-    auto attempt = std::async(std::launch::async, [] { return connect("d1"); });
+    auto attempt = std::async(std::launch::async, [] { return control("connectSSDP", {"d1"}); });
     ASSERT_TRUE(phone.request(kWellBeforeLong));  // the attempt now waits for the answer
+
+    const Json busy = {{"error", -10001}, {"error_message", "STATE_BUSY"}, {"connection_steps", "_WI:-1"}};
+    EXPECT_EQ(control("connectSSDP", {"d1"}), busy);
+    // Called directly, past the dispatcher's slot, the attempt still refuses to interleave.
+    EXPECT_EQ(connect("d1"), busy);
+
     EXPECT_EQ(control("cancelSSDPConnect"), (Json{{"error", 0}, {"error_message", ""}}));
     ASSERT_EQ(attempt.wait_for(kWellBeforeLong), std::future_status::ready);
     EXPECT_EQ(attempt.get(), (Json{{"error", -10005},
@@ -134,29 +141,13 @@ TEST_F(ActiveConnectTest, CancelEndsTheWaitAtOnce) {
                                    {"errir_message", "CANCEL"},
                                    {"connection_steps", "_WI:0_WF:0_TF:0_WO:-90"}}));
     EXPECT_TRUE(phone.pcClosed(kWellBeforeLong));
+    EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());  // the slot is free again
 
     // A cancel with no attempt running changes nothing for the next attempt.
     control("cancelSSDPConnect");
     Phone next(answering(kAnswer));
     usePhone(next);
     EXPECT_EQ(connect("d1")["error"], 0);
-}
-
-TEST_F(ActiveConnectTest, SecondRequestWhileOneWaitsIsBusy) {
-    Phone phone(answering(kSilent));
-    usePhone(phone);
-    auto first = std::async(std::launch::async, [] { return control("connectSSDP", {"d1"}); });
-    ASSERT_TRUE(phone.request(kWellBeforeLong));
-
-    const Json busy = {{"error", -10001}, {"error_message", "STATE_BUSY"}, {"connection_steps", "_WI:-1"}};
-    EXPECT_EQ(control("connectSSDP", {"d1"}), busy);
-    // Called directly, past the dispatcher's slot, the attempt still refuses to interleave.
-    EXPECT_EQ(connect("d1"), busy);
-
-    control("cancelSSDPConnect");
-    ASSERT_EQ(first.wait_for(kWellBeforeLong), std::future_status::ready);
-    EXPECT_EQ(first.get()["error"], -10005);
-    EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());  // the slot is free again
 }
 
 }  // namespace

@@ -150,7 +150,6 @@ TEST_F(Dispatch, AllowWindowAnswersReleaseTheWaiterOnceEach) {
 }
 
 TEST_F(Dispatch, ConnectionRequestsAndBusyAnswers) {
-    EXPECT_TRUE(control("connectSSDP").is_null());
     EXPECT_EQ(control("connectSSDP", {"no-such-id"})["error"], -10002);
     EXPECT_TRUE(ConnectionState::getIsCanConnectDevice());  // the slot is given back (busy: ActiveConnectTest)
 
