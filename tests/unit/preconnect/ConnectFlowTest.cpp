@@ -77,23 +77,22 @@ TEST_F(ConnectFlowTest, NoAnswerAnywhereIsAFailureNotASuccess) {
               reply(-10000, "parser phone data failed", "", "_WFD:0_WSR:0_WRR:-1_TF:0_WO:-1"));
 }
 
-TEST_F(ConnectFlowTest, APhonePortThatRefusesIsAFailedStep) {
-    std::unique_ptr<phonesim::Listener> phone;
-    const auto entry = holdPhone(phone, phonesim::Answer::HangUp);
-    env.config().phoneTcpPort = freeTcpPort();  // the fallback finds nobody listening
-    EXPECT_EQ(connect(entry->getDeviceId()),
-              reply(-10000, "parser phone data failed", "", "_WFD:0_WSR:0_WRR:-1_TF:-1_WO:-1"));
-}
-
-// The answer wait ends with the link, not at its time-out.
-TEST_F(ConnectFlowTest, ALinkThatBreaksEndsTheWaitForTheAnswer) {
+// A held link that breaks ends the wait for its answer at once, not at the time-out; the fresh
+// link then finds the phone silent, or nobody listening.
+TEST_F(ConnectFlowTest, ABrokenLinkEndsTheAnswerWaitAndAFailedFreshLinkIsAFailure) {
     env.config().connectFlowAnswerTimeout = 60s;
     env.config().connectFlowFallbackTimeout = 500ms;
-    std::unique_ptr<phonesim::Listener> phone;
-    const auto entry = holdPhone(phone, phonesim::Answer::HangUp);
-    auto result = std::async(std::launch::async, [&] { return connect(entry->getDeviceId()); });
-    ASSERT_EQ(result.wait_for(20s), std::future_status::ready);
-    EXPECT_EQ(result.get()["connection_steps"], "_WFD:0_WSR:0_WRR:-1_TF:0_WO:-1");
+    for (const bool refused : {false, true}) {
+        SCOPED_TRACE(refused ? "nobody listening" : "silent");
+        std::unique_ptr<phonesim::Listener> phone;
+        const auto entry = holdPhone(phone, phonesim::Answer::HangUp);
+        if (refused) env.config().phoneTcpPort = freeTcpPort();
+        auto result = std::async(std::launch::async, [&] { return connect(entry->getDeviceId()); });
+        ASSERT_EQ(result.wait_for(20s), std::future_status::ready);
+        EXPECT_EQ(result.get(), reply(-10000, "parser phone data failed", "",
+                                      refused ? "_WFD:0_WSR:0_WRR:-1_TF:-1_WO:-1" : "_WFD:0_WSR:0_WRR:-1_TF:0_WO:-1"));
+        registry.clearAllDevices();
+    }
 }
 
 TEST_F(ConnectFlowTest, CancelIsSeenBetweenTheSteps) {
