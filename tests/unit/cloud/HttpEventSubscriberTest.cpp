@@ -70,9 +70,6 @@ TEST_F(HttpEventSubscriberTest, AccountChangeUnbindsReportsAndFetchesInThatOrder
     handle(ServiceEvent::AccountChange);
 
     EXPECT_EQ(paths(), (std::vector<std::string>{"/device/unBind", "/device/report", "/device/list"}));
-    const Json report = Json::parse(center.requestsTo("/device/report").at(0).body);
-    EXPECT_EQ(report[0]["userId"], "open-1");
-    EXPECT_EQ(report[0]["inets"][0]["localInet"], "10.0.0.5");
     EXPECT_EQ(subscriber->lastReportDeviceInfo(), Json::array());  // accepted
     EXPECT_EQ(registry.getDevicesSize(), 2);                       // the phones, not the PC
 
@@ -109,8 +106,11 @@ TEST_F(HttpEventSubscriberTest, ACenterThatRefusesIsDownOrSlowChangesNothingAndH
     EXPECT_EQ(subscriber->lastReportDeviceInfo().size(), 1u);
     const auto record = telemetry.receive(5s);
     ASSERT_TRUE(record);
-    EXPECT_EQ(Json::parse(*record)["value"],
-              Json::parse(R"({"fail_code":120002,"fail_reason":"token expired","trigger_reason":"LogOnEvent"})"));
+    Json failure = Json::parse(*record);
+    EXPECT_GT(failure["createTime"].get<long long>(), 1700000000000LL);
+    failure.erase("createTime");
+    EXPECT_EQ(failure, Json::parse(R"({"pType":0,"eventID":"W688|10316","isDayReport":0,"value":)"
+                                   R"({"fail_code":120002,"fail_reason":"token expired","trigger_reason":"LogOnEvent"}})"));
     EXPECT_TRUE(test::logged(
         "[HttpEventSubscriber::getPreDeviceList] device/list request failed! status: 120002, msg: token expired"));
 

@@ -1,14 +1,11 @@
 // Push messages relayed by the PC suite, through the dispatcher, against a stub connect center
 // and PC suite on loopback and a real bus subscriber: the client id, the notices for the bus,
-// a phone's connect request (pre-connected, or connected by the PC suite) and what goes back
-// to the center, and messages of the wrong shape.
+// a phone's connect request (an unknown phone's pre-connect, or a connection by the PC suite)
+// and what goes back to the center, and messages of the wrong shape.
 #include "cloud/KPushReceiveEventHandler.h"
 #include "preconnect/FarawayDevice.h"
-#include "preconnect/PreConnectionThread.h"
-#include "preconnect/StrategyDevicePreconnect.h"
 #include "unit/cloud/CloudFixture.h"
 #include "unit/events/EventRecorder.h"
-#include "unit/preconnect/PreconnectFixture.h"
 
 namespace kesu {
 namespace {
@@ -145,30 +142,6 @@ TEST_F(KPushTest, MalformedMessagesAreTakenAsAbsentAndAnsweredCleanly) {
     EXPECT_EQ(sent[1], report("ev-7", 2, 20000, "Preconnect failed"));
     EXPECT_EQ(sent[2], report("ev-7", 2, 20000, "UNKNOWN"));
     EXPECT_TRUE(test::logged("[KPushReceiveEventHandler][passivePreConnect] \"businessId\" is not a string \n"));
-}
-
-// A phone that really pre-connects: the notice waits for the handshake and reports success.
-class KPushPreconnectTest : public test::SchedulingTest {
-protected:
-    void SetUp() override {
-        SchedulingTest::SetUp();
-        dataInstance().set(&databaseParam::pcDeviceId, "pc-1");
-        center.setDefaultAnswer({200, R"({"code":0})"});
-        Endpoints::setConnectCenterServerUrl(center.baseUrl());
-    }
-
-    test::StubPcSuite center;
-};
-
-TEST_F(KPushPreconnectTest, PreConnectOfAKnownPhoneReportsSuccess) {
-    phonesim::Listener phone(phoneOptions());
-    env.config().phoneTcpPort = phone.port();
-    DeviceWaitForPreConnectManager::instance().addFarawayDevices({{"data", {cloudRecord({"127.0.0.1"})}}});
-    scheduler.run();
-    EXPECT_EQ(test::control("kpush", phoneConnect("ev-8", "SIMPHONE01", "PreConnect")), kSuccess);
-    const auto sent = center.requestsTo("/event/report");
-    ASSERT_EQ(sent.size(), 1u);
-    EXPECT_EQ(Json::parse(sent[0].body), report("ev-8", 1, 0, "", "openid-of-pc"));
 }
 
 }  // namespace

@@ -13,6 +13,7 @@ namespace {
 TEST(PcReportTest, DescribesThePcFromTheAccountAndTheSystem) {
     test::HermeticEnv env;
     ScopedFakePlatform fake;
+    test::resetSharedStateForTest();  // no host name an earlier test had read stays cached
     fake->addAdapter("Wi-Fi", "wlan0", "aa:bb:cc:dd:ee:01", "10.0.0.5", "255.255.255.0");
     fake->addAdapter("Ethernet", "eth0", "aa:bb:cc:dd:ee:02", "192.168.1.9", "255.255.0.0");
     fake->setWifiSsid("home");

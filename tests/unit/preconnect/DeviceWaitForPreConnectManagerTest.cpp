@@ -1,9 +1,8 @@
-// The registry: merging cloud device lists into entries, the candidate order, and the two
-// device-list telemetry records.
+// The registry: merging cloud device lists into entries, the candidate order, and the daily
+// device-list record (its failure record is checked in HttpEventSubscriberTest).
 #include "PreconnectFixture.h"
 
 #include "preconnect/DeviceWaitForPreConnectManager.h"
-#include "support/UdpCatcher.h"
 #include "core/WallClock.h"
 
 namespace kesu {
@@ -165,21 +164,6 @@ TEST_F(RegistryTest, DeviceListRecordAtMostDailyWhileSendsSucceed) {
                             {"params", {{"type", "phone#pc#"}, {"device_model", "M1#PC-9#M1#"}}}}}));
     EXPECT_FALSE(fresh.sendDeviceListBuryPoint(req, 120));  // sent today
     WallClock::setClock({});
-}
-
-TEST_F(RegistryTest, DeviceListFailureIsOneDatagram) {
-    test::UdpCatcher collector;
-    env.config().telemetryUdpPort = collector.port();
-    EXPECT_TRUE(registry.sendDeviceListFailBuryPoint(401, "token expired", "AccountChangeEvent"));
-    const auto datagram = collector.receive(2s);
-    ASSERT_TRUE(datagram);
-    Json record = Json::parse(*datagram);
-    EXPECT_GT(record["createTime"].get<long long>(), 1700000000000LL);
-    record.erase("createTime");
-    EXPECT_EQ(record, Json({{"pType", 0},
-                            {"eventID", "W688|10316"},
-                            {"value", {{"fail_code", 401}, {"fail_reason", "token expired"}, {"trigger_reason", "AccountChangeEvent"}}},
-                            {"isDayReport", 0}}));
 }
 
 }  // namespace
