@@ -1,6 +1,8 @@
 // The connect-center client against a real stub center on loopback: the signed requests of
 // each operation, the cases where nothing may go out, the replies that do not count, a center
-// that is down, and the account's tokens kept out of the log.
+// that is down, slow or throttling, and the account's tokens kept out of the log.
+#include <cstdlib>
+
 #include "cloud/ConnectCenterRequest.h"
 #include "unit/cloud/CloudFixture.h"
 
@@ -33,10 +35,13 @@ TEST_F(ConnectCenterRequestTest, SendsSignedRequestsAndReturnsAcceptedReplies) {
     EXPECT_EQ(msg, "ok");
     auto sent = center.requests();
     ASSERT_EQ(sent.size(), 1u);
-    // The method and the userId, token and deviceId headers are checked in PreconnectE2ETest.
+    EXPECT_EQ(sent[0].method, "GET");
     EXPECT_EQ(sent[0].target, "/device/list");  // no doubled slash after the base URL's own
+    EXPECT_EQ(sent[0].header("userId"), "open-1");
+    EXPECT_EQ(sent[0].header("token"), kToken);
     EXPECT_EQ(sent[0].header("source"), "2");
     EXPECT_EQ(sent[0].header("version"), "1.2.3");
+    EXPECT_EQ(sent[0].header("deviceId"), "pc-1");
 
     // Ids go into the query encoded, so that none can add parameters of its own.
     center.clearRequests();
@@ -148,12 +153,63 @@ TEST_F(ConnectCenterRequestTest, OnlyAnIntegerZeroCodeIsAccepted) {
     EXPECT_TRUE(test::logged(R"([ConnectCenterRequest][responseIntercept] path: /device/list, request err: {"code":120000,)"));
 }
 
-// Slow and throttling servers are RequestBaseTest's; a center that is down changes nothing.
-TEST_F(ConnectCenterRequestTest, ACenterThatIsDownLeavesStatusAndMsg) {
+TEST_F(ConnectCenterRequestTest, SurvivesACenterThatIsDownSlowOrThrottling) {
+    // Down: nothing answers on the port.
     Endpoints::setConnectCenterServerUrl("http://127.0.0.1:" + std::to_string(test::freeTcpPort()));
     EXPECT_FALSE(ConnectCenterRequest::getDeviceList(status, msg));
     EXPECT_EQ(status, -1);
     EXPECT_EQ(msg, "caller");
+
+    // Slow: the answer comes after the request's time-out.
+    Endpoints::setConnectCenterServerUrl(center.baseUrl());
+    env.config().httpRequestTimeout = 200ms;
+    center.setAnswer("/event/create", {200, R"({"code":0})", "application/json", 30s});
+    EXPECT_FALSE(ConnectCenterRequest::createEvent(Json::object(), status, msg));
+
+    // Throttled: three attempts at most, then no value; a 429 followed by an answer succeeds.
+    env.config().httpRequestTimeout = 2s;
+    center.setAnswer("/device/list", {429, R"({"code":10005})"});
+    EXPECT_FALSE(ConnectCenterRequest::getDeviceList(status, msg));
+    EXPECT_EQ(center.requestsTo("/device/list").size(), 3u);
+    center.clearRequests();
+    center.queueAnswer("/device/report", {429, R"({"code":10005})"});
+    center.setAnswer("/device/report", {200, R"({"code":0})"});
+    EXPECT_TRUE(ConnectCenterRequest::reportDevice(Json::array(), status, msg));
+    EXPECT_EQ(center.requestCount(), 2u);
+}
+
+// https: the center's certificate is checked against the system's trust store (here a test CA
+// handed to OpenSSL's default locations) and must name the host that was asked.
+TEST_F(ConnectCenterRequestTest, HttpsTrustsTheSystemStoreAndChecksTheName) {
+    const std::string dir = env.dir().str();
+    const auto sh = [](const std::string& command) { return std::system((command + " >/dev/null 2>&1").c_str()) == 0; };
+    const std::string ec = " -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes";
+    bool made = sh("openssl req -x509" + ec + " -keyout " + dir + "/ca.key -out " + dir + "/ca.pem -days 2 -subj /CN=TestCA");
+    for (const std::string name : {"good", "other"}) {
+        const std::string san = name == "good" ? "IP:127.0.0.1" : "DNS:other.example";
+        made = made && sh("openssl req" + ec + " -keyout " + dir + "/" + name + ".key -out " + dir + "/" + name +
+                          ".csr -subj /CN=" + name) &&
+               !env.dir().write(name + ".ext", "subjectAltName=" + san + "\n").empty() &&
+               sh("openssl x509 -req -in " + dir + "/" + name + ".csr -CA " + dir + "/ca.pem -CAkey " + dir +
+                  "/ca.key -CAcreateserial -days 2 -out " + dir + "/" + name + ".pem -extfile " + dir + "/" + name +
+                  ".ext");
+    }
+    if (!made) GTEST_SKIP() << "openssl could not make the test certificates";
+    test::ScopedEnv trustStore("SSL_CERT_FILE", dir + "/ca.pem");
+    env.config().caCertPath.clear();
+
+    test::StubPcSuite good(dir + "/good.pem", dir + "/good.key");
+    good.setDefaultAnswer({200, R"({"code":0})"});
+    Endpoints::setConnectCenterServerUrl(good.baseUrl());
+    EXPECT_TRUE(ConnectCenterRequest::getDeviceList(status, msg));
+    EXPECT_EQ(good.requestCount(), 1u);
+
+    // Signed by the trusted CA, but for another name: refused before anything is sent.
+    test::StubPcSuite other(dir + "/other.pem", dir + "/other.key");
+    other.setDefaultAnswer({200, R"({"code":0})"});
+    Endpoints::setConnectCenterServerUrl(other.baseUrl());
+    EXPECT_FALSE(ConnectCenterRequest::getDeviceList(status, msg));
+    EXPECT_EQ(other.requestCount(), 0u);
 }
 
 }  // namespace
