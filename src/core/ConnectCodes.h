@@ -2,7 +2,6 @@
 // frames, step result names, the application a phone asks for and the service ids.
 #pragma once
 
-#include <optional>
 #include <string>
 #include <string_view>
 
@@ -73,12 +72,5 @@ int rawValue(ConnectTag tag);
 std::string rawValue(Result result);
 int rawValue(AppSource source);
 std::string rawValue(serviceId id);  // "com.kesu.pcsuite.SERVICE", "com.kesu.share.CONNECT_PC"
-
-// The case of a raw value; nullopt for a value that has none.
-std::optional<ErrorCode> parseErrorCode(int raw);
-std::optional<ConnectTag> parseConnectTag(int raw);
-std::optional<Result> parseResult(std::string_view raw);
-std::optional<AppSource> parseAppSource(int raw);
-std::optional<serviceId> parseServiceId(std::string_view raw);
 
 }  // namespace kesu
